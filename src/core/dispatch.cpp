@@ -1,0 +1,418 @@
+// dispatch.cpp: the trace function. c_dispatch decides which thread may enter the debugger,
+// serialises entry with the selvane mutex, counts events, runs the idle callback, delivers
+// injected exceptions, and hands each event to its handler, which calls the line, return or
+// exception callback when the stepping state or a breakpoint says to stop.
+//
+// Nothing here may change what the program sees: errno is restored on every path, the
+// pending exception is kept, and a failure switches tracing off for the thread instead of
+// raising into user code.
+#include "core/dispatch.h"
+
+#include <cerrno>
+#include <cstring>
+#include <ctime>
+
+#include "bp/breakhere.h"
+#include "core/exception_dispatch.h"
+#include "core/install.h"
+#include "core/stepping.h"
+#include "core/thread_policy.h"
+#include "core/tracercore.h"
+#include "names/conames.h"
+#include "support/dbgcommon.h"
+#include "support/dprintf.h"
+#include "support/pycompat.h"
+
+namespace {
+
+// Set by the fork handler in the child; read once per event as a plain flag.
+volatile int gForkSeen = 0;
+
+// The event this thread is dispatching: whether it holds the selvane mutex for it yet.
+struct EventState {
+  PyObject* frame = nullptr;  // borrowed for the duration of the event
+  bool entered = false;
+};
+thread_local EventState* tEvent = nullptr;
+
+class ErrnoGuard {
+ public:
+  ErrnoGuard() : saved_(errno) {}
+  ~ErrnoGuard() { errno = saved_; }
+
+ private:
+  int saved_;
+};
+
+void check_fork() {
+  gForkSeen = 0;
+  gSelf.in_forked_child = getpid() != gSelf.pid ? 1 : 0;
+}
+
+// Debug output is diagnostics: while it is on, every event takes the mutex up front, in
+// the order the messages describe.
+bool debug_output_on() { return dprintf_wanted(kDbgFlow | kDbgExceptions | kDbgPathnames); }
+
+void leave_debugger(EventState& event) {
+  if (!event.entered) return;
+  __tracer_clear_curr_frame();
+  release_selvane_mutex();
+  event.entered = false;
+}
+
+int dispatch_by_event(PyFrameObject* frame, int what, PyObject* arg, bool* propagate) {
+  PyObject* f = reinterpret_cast<PyObject*>(frame);
+  int result = 0;
+  switch (what) {
+    case PyTrace_CALL:
+      result = dispatch_call(f);
+      if (result == -2) {
+        do_dprintf(kDbgFlow, "PROPAGATING EXCEPTION INTO USER CODE\n");
+        *propagate = true;
+        return 0;
+      }
+      if (result != 0) {
+        do_dprintf(kDbgFlow, "TRACER CALL STOPPED TRACER\n");
+        return -1;
+      }
+      return 0;
+    case PyTrace_EXCEPTION:
+      result = dispatch_exception(f, arg);
+      if (result != 0) do_dprintf(kDbgFlow, "TRACER EXC STOPPED TRACER\n");
+      return result != 0 ? -1 : 0;
+    case PyTrace_LINE:
+      result = dispatch_line(f);
+      if (result != 0) do_dprintf(kDbgFlow, "TRACER LINE STOPPED TRACER\n");
+      return result != 0 ? -1 : 0;
+    case PyTrace_RETURN:
+      result = dispatch_return(f, compat::return_value_of_event(frame, arg));
+      if (result != 0) do_dprintf(kDbgFlow, "TRACER RETURN STOPPED TRACER\n");
+      return result != 0 ? -1 : 0;
+    default:
+      return 0;
+  }
+}
+
+PyObject* f_trace_name() {
+  static PyObject* name = PyUnicode_InternFromString("f_trace");
+  return name;
+}
+
+// A new frame gets trace_dispatch in f_trace when the thread traces through it, so that
+// jumps (setting f_lineno) work from the callbacks.
+void give_frame_f_trace(PyFrameObject* frame) {
+  PyThreadState* ts = compat::current_tstate();
+  if (!gSelf.trace_dispatch || !gSelf.trace_dispatch.is(compat::tstate_traceobj(ts))) return;
+  PyObject* f = reinterpret_cast<PyObject*>(frame);
+  Ref current = Ref::steal(PyObject_GetAttr(f, f_trace_name()));
+  if (current && !current.is_none()) return;
+  if (PyObject_SetAttr(f, f_trace_name(), gSelf.trace_dispatch.get()) != 0 || !current) {
+    PyErr_Clear();
+  }
+}
+
+// Steps 8 to 11 of an event, once the thread may enter. Returns the trace function's result.
+int run_event(PyFrameObject* frame, int what, PyObject* arg) {
+  bool stopped = false;
+  bool propagate = false;
+  if (!__ensure_tracer_status()) {
+    do_dprintf(kDbgFlow, "TRACER STOPPED WHILE WAITING FOR MUTEX\n");
+  } else {
+    ++gSelf.instruction_count;
+    if (do_idle() != 0) {
+      do_dprintf(kDbgFlow, "IDLE STOPPED TRACER\n");
+      stopped = true;
+    } else {
+      stopped = dispatch_by_event(frame, what, arg, &propagate) != 0;
+      if (!stopped && !propagate && what == PyTrace_CALL) give_frame_f_trace(frame);
+    }
+  }
+  if (stopped || !gSelf.trace_started) {
+    enter_debugger();
+    // A failed callback switches tracing off for this thread and never raises into the
+    // program's frames: the interpreter reports the error as an unraisable exception.
+    if (PyErr_Occurred() != nullptr) PyErr_WriteUnraisable(gSelf.trace_dispatch.get());
+    remove_tracer_from_frames(compat::current_tstate());
+    set_global_trace_function(0);
+    PyErr_Clear();
+  }
+  return propagate ? -1 : 0;
+}
+
+}  // namespace
+
+void note_fork_in_child() { gForkSeen = 1; }
+
+void enter_debugger() {
+  EventState* event = tEvent;
+  if (event == nullptr || event->entered) return;
+  event->entered = true;
+  __tracer_set_curr_frame(event->frame);
+  acquire_selvane_mutex();
+}
+
+int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
+  ErrnoGuard errno_guard;
+  if (gForkSeen) check_fork();
+  if (gSelf.in_forked_child) return 0;
+  compat::note_event(frame, what);
+  unsigned long identity = get_thread_ident();
+  if (gSelf.pending_exception_count != 0 &&
+      __tracer_raise_pending_exception(get_current_thread_data(&gSelf.thread_table))) {
+    return -1;
+  }
+  if (gSelf.selvane_mutex_owner == identity) {
+    do_dprintf(kDbgFlow, "recursive c_dispatch\n");
+    return 0;
+  }
+  if (!gSelf.debug_all_threads && gSelf.selvane_mutex_owner != kNoMutexOwner) {
+    do_dprintf(kDbgFlow, "ignoring thread in c_dispatch\n");
+    return 0;
+  }
+  if (!__should_debug_thread(identity)) {
+    do_dprintf(kDbgFlow, "ignore thread by policy\n");
+    return 0;
+  }
+  EventState event{reinterpret_cast<PyObject*>(frame), false};
+  EventState* outer = tEvent;
+  tEvent = &event;
+  // Another thread inside the debugger: wait for it here, before anything is decided.
+  if (gSelf.selvane_mutex_owner != kNoMutexOwner || debug_output_on()) enter_debugger();
+  int result = run_event(frame, what, arg);
+  leave_debugger(event);
+  tEvent = outer;
+  return result;
+}
+
+PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args) {
+  if (!PyTuple_Check(args) || PyTuple_GET_SIZE(args) != 3) {
+    PyErr_SetString(PyExc_TypeError, "trace_dispatch takes (frame, event, arg)");
+    return nullptr;
+  }
+  PyObject* frame = PyTuple_GET_ITEM(args, 0);
+  PyObject* event = PyTuple_GET_ITEM(args, 1);
+  PyObject* arg = PyTuple_GET_ITEM(args, 2);
+  if (!compat::is_plain_frame(frame)) {
+    PyErr_SetString(PyExc_TypeError, "trace_dispatch needs a frame");
+    return nullptr;
+  }
+  const char* name = _pystring_to_c_string(event);
+  int what = -1;
+  switch (name != nullptr ? name[0] : '\0') {
+    case 'c': what = PyTrace_CALL; break;
+    case 'e': what = PyTrace_EXCEPTION; break;
+    case 'l': what = PyTrace_LINE; break;
+    case 'r': what = PyTrace_RETURN; break;
+    default: break;
+  }
+  int result = what < 0 ? 0 : c_dispatch(self, reinterpret_cast<PyFrameObject*>(frame), what, arg);
+  if (result != 0) {
+    if (PyErr_Occurred() != nullptr) return nullptr;
+    Py_RETURN_NONE;
+  }
+  // Switch the thread from the Python-level trampoline to direct C tracing.
+  PyThreadState* ts = compat::current_tstate();
+  if (gSelf.trace_dispatch && gSelf.trace_dispatch.is(compat::tstate_traceobj(ts)) &&
+      compat::tstate_tracefunc(ts) != c_dispatch) {
+    PyEval_SetTrace(c_dispatch, gSelf.trace_dispatch.get());
+    if (PyErr_Occurred() != nullptr) return nullptr;
+  }
+  return gSelf.trace_dispatch.new_ref();
+}
+
+int __ensure_tracer_status() {
+  unsigned long identity = get_thread_ident();
+  if (!gSelf.trace_started) {
+    enter_debugger();
+    do_dprintf(kDbgFlow, "trace_dispatch called while not tracing; thread = %ld\n", identity);
+    remove_tracer_from_frames(compat::current_tstate());
+    set_global_trace_function(0);
+    return 0;
+  }
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data == nullptr) {
+    DLOGEXCEPTION();
+    PyErr_Clear();
+    return 0;
+  }
+  if (!data->tracer_in_frames) {
+    enter_debugger();
+    install_tracer_into_frames(compat::current_tstate());
+  }
+  data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data != nullptr && !data->global_trace_set) {
+    enter_debugger();
+    set_global_trace_function(1);
+  }
+  return 1;
+}
+
+namespace {
+
+bool is_module_level(PyObject* frame) {
+  auto* f = reinterpret_cast<PyFrameObject*>(frame);
+  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(f)));
+  // Function code has its own fast locals: asking for them would sync them into a dict.
+  if (reinterpret_cast<PyCodeObject*>(code.get())->co_flags & CO_OPTIMIZED) return false;
+  Ref locals = Ref::steal(PyFrame_GetLocals(f));
+  Ref globals = Ref::steal(PyFrame_GetGlobals(f));
+  if (!locals) PyErr_Clear();
+  return locals && locals.get() == globals.get();
+}
+
+void print_call(PyObject* frame) {
+  if (!dprintf_wanted(kDbgFlow)) return;
+  auto* f = reinterpret_cast<PyFrameObject*>(frame);
+  Ref locals = Ref::steal(PyFrame_GetLocals(f));
+  if (!locals) PyErr_Clear();
+  Ref globals = Ref::steal(PyFrame_GetGlobals(f));
+  do_dprintf(kDbgFlow, "in call: locals = %p, globals = %p, thread = %ld\n", locals.get(),
+             globals.get(), get_thread_ident());
+}
+
+// Makes sure a function's code object knows its file; -2 when the lookup failed.
+int register_function_code(PyObject* frame) {
+  COPathnameTable* table = &gSelf.co_pathname_table;
+  // The periodic sweep releases code objects, which can run arbitrary code.
+  if (table->sweep_counter >= 4999) enter_debugger();
+  Ref code = Ref::steal(
+      reinterpret_cast<PyObject*>(PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(frame))));
+  if (LookupCOPathname(table, code.get()) != nullptr) return 0;
+  if (PyErr_Occurred() != nullptr) return -2;
+  PyObject* filename = reinterpret_cast<PyCodeObject*>(code.get())->co_filename;
+  __resolve_module_full_path(table, nullptr, filename, code.get());
+  return 0;
+}
+
+}  // namespace
+
+int dispatch_call(PyObject* frame) {
+  if (!gSelf.trace_started) return -1;
+  if (!compat::is_plain_frame(frame)) return 0;
+  print_call(frame);
+  if (!is_module_level(frame)) {
+    if (register_function_code(frame) == -2) return -2;
+  }
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data == nullptr) {
+    PyErr_Clear();
+    return 0;
+  }
+  if (data->bot_frame.is_none()) data->bot_frame = Ref::borrow(frame);
+  return 0;
+}
+
+int dispatch_line(PyObject* frame) {
+  if (!gSelf.trace_started) return -1;
+  if (!compat::is_plain_frame(frame)) return 0;
+  compat::PendingError saved;
+  saved.fetch();
+  if (dprintf_wanted(kDbgFlow)) {
+    const char* path = __tracer_get_full_path(&gSelf.co_pathname_table, frame);
+    if (path == nullptr) PyErr_Clear();
+    do_dprintf(kDbgFlow, "in dispatch_line: file=%s, lineno=%d\n", dprint_check_str(path),
+               PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(frame)));
+  }
+  int result = 0;
+  if (__tracer_stop_here(frame, 1) ||
+      __tracer_break_here(&gSelf.bp_ops_data, 1,
+                          current_thread_data_or_insert(&gSelf.thread_table), frame, 1)) {
+    if (do_callback(gSelf.line_cb.get(), frame, nullptr) != 0) result = -1;
+  }
+  if (result == 0) {
+    saved.restore();
+  } else {
+    // The callback's error is what the interpreter must report; the saved state is dropped.
+    compat::PendingError failure;
+    failure.fetch();
+    saved.restore();
+    PyErr_Clear();
+    failure.restore();
+  }
+  return result;
+}
+
+namespace {
+
+Ref frame_f_trace(PyObject* frame) {
+  Ref trace = Ref::steal(PyObject_GetAttr(frame, f_trace_name()));
+  if (!trace) PyErr_Clear();
+  return trace;
+}
+
+bool untraced_after_stop(PyObject* frame) {
+  if (gSelf.trace_started) return false;
+  Ref trace = frame_f_trace(frame);
+  return !trace || trace.is_none();
+}
+
+}  // namespace
+
+void call_quit_cb_if_autoquit() {
+  if (!gSelf.autoquit || !gSelf.quit_cb) return;
+  enter_debugger();
+  compat::PendingError saved;
+  saved.fetch();
+  Ref result = Ref::steal(PyObject_CallNoArgs(gSelf.quit_cb.get()));
+  saved.restore();
+}
+
+int dispatch_return(PyObject* frame, PyObject* retval) {
+  if (!gSelf.trace_started) return -1;
+  if (retval == nullptr) {
+    if (dispatch_exception_return(frame, nullptr) != 0) return -1;
+    if (untraced_after_stop(frame)) return 0;
+  }
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data == nullptr) {
+    PyErr_Clear();
+    return 0;
+  }
+  bool stop = data->step_out_frame.is(frame) || __tracer_stop_here(frame, 2);
+  if (stop) {
+    return do_callback(gSelf.return_cb.get(), frame, retval != nullptr ? retval : Py_None) != 0
+               ? -1
+               : 0;
+  }
+  if (data->bot_frame.is(frame)) {
+    unsigned long identity = get_thread_ident();
+    enter_debugger();  // dropping the frame may run finalizers
+    data->bot_frame = Ref::none();
+    call_quit_cb_if_autoquit();
+    __clear_should_debug_thread_cache(identity);
+    if (untraced_after_stop(frame)) return 0;
+  }
+  return 0;
+}
+
+int do_callback(PyObject* cb, PyObject* frame, PyObject* arg) {
+  enter_debugger();
+  if (cb == nullptr) return 0;
+  Ref changed = Ref::steal(__tracer_get_changed_bps_lists(&gSelf.bp_ops_data));
+  if (!changed) return -1;
+  Ref result = Ref::steal(arg == nullptr ? do_two_arg_call(cb, frame, changed.get())
+                                         : do_three_arg_call(cb, frame, arg, changed.get()));
+  return result ? 0 : -1;
+}
+
+int do_idle() {
+  if (!gSelf.trace_started) return -1;
+  if (gSelf.in_idle || !(gSelf.idle_period > 0)) return 0;
+  gSelf.in_idle = 1;
+  if (++gSelf.idle_tick > gSelf.idle_tick_limit) {
+    gSelf.idle_tick = 0;
+    time_t now = time(nullptr);
+    if (gSelf.next_idle_time <= now) {
+      gSelf.next_idle_time = now + 1;
+      enter_debugger();
+      // The idle callback's result is not ours; its error would leak into the program.
+      Ref result = Ref::steal(PyObject_CallNoArgs(gSelf.idle_cb.get()));
+      if (!result) {
+        DLOGEXCEPTION();
+        PyErr_Clear();
+      }
+    }
+  }
+  gSelf.in_idle = 0;
+  return 0;
+}

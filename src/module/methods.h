@@ -1,0 +1,49 @@
+// methods.h: the C functions behind the module's Python methods, grouped by the file that
+// defines them. Each wrapper parses its arguments, calls the core and converts the result.
+#pragma once
+
+#include <Python.h>
+
+// vantrelmodule.cpp: lifecycle.
+PyObject* _tracer_init(PyObject* self, PyObject* args);
+PyObject* _tracer_reset(PyObject* self, PyObject* args);
+PyObject* _tracer_destroy(PyObject* self, PyObject* args);
+
+// runcontrol_methods.cpp: run-control settings, thread queries, the selvane mutex.
+PyObject* _tracer_set_autoquit(PyObject* self, PyObject* args);
+PyObject* _tracer_set_idle_period(PyObject* self, PyObject* args);
+PyObject* _tracer_set_debug_all_threads(PyObject* self, PyObject* args);
+PyObject* _tracer_set_debug_thread_cb(PyObject* self, PyObject* args);
+PyObject* _tracer_get_threads(PyObject* self, PyObject* args);
+PyObject* _tracer_get_curr_frame(PyObject* self, PyObject* args);
+PyObject* _tracer_get_thread_name(PyObject* self, PyObject* args);
+PyObject* _tracer_is_botframe(PyObject* self, PyObject* args);
+PyObject* get_tracing(PyObject* self, PyObject* args);
+PyObject* _tracer_acquire_selvane_mutex(PyObject* self, PyObject* args);
+PyObject* _tracer_release_selvane_mutex(PyObject* self, PyObject* args);
+
+// tstate_methods.cpp: thread-state and frame utilities.
+PyObject* locals_to_fast(PyObject* self, PyObject* args);
+PyObject* wrap_PyFrame_LocalsToFast(PyObject* self, PyObject* args);
+PyObject* get_frame_file(PyObject* self, PyObject* args);
+PyObject* get_current_tstate_id(PyObject* self, PyObject* args);
+PyObject* get_thread_ident_for_tstate_id(PyObject* self, PyObject* args);
+PyObject* add_to_tstate_tracing(PyObject* self, PyObject* args);
+PyObject* get_tstate_tracing(PyObject* self, PyObject* args);
+PyObject* set_tstate_use_tracing(PyObject* self, PyObject* args);
+PyObject* get_tstate_use_tracing(PyObject* self, PyObject* args);
+
+// trace_methods.cpp: tracing on and off, stepping commands, thread hooks, raise_exception.
+PyObject* _tracer_start_trace(PyObject* self, PyObject* args);
+PyObject* _tracer_stop_trace(PyObject* self, PyObject* args);
+PyObject* _tracer_step_into(PyObject* self, PyObject* args);
+PyObject* _tracer_step_over(PyObject* self, PyObject* args);
+PyObject* _tracer_step_over_line(PyObject* self, PyObject* args);
+PyObject* _tracer_step_over_line_range(PyObject* self, PyObject* args);
+PyObject* _tracer_step_out(PyObject* self, PyObject* args);
+PyObject* _tracer_continue_run(PyObject* self, PyObject* args);
+PyObject* _tracer_stop(PyObject* self, PyObject* args);
+PyObject* _tracer_bootstrap_new_thread(PyObject* self, PyObject* args);
+PyObject* _tracer_thread_exiting(PyObject* self, PyObject* args);
+PyObject* _tracer_is_internal_frame(PyObject* self, PyObject* args);
+PyObject* raise_exception(PyObject* self, PyObject* args);

@@ -1,0 +1,196 @@
+// vantrelmodule.cpp: the module object tvantrel30pydebugstackless: load order, the method
+// table and the lifecycle methods init, reset and destroy. Every method is a thin wrapper;
+// the behaviour lives in the subsystem that the wrapper calls.
+#include <Python.h>
+
+#include <cstdio>
+
+#include <pthread.h>
+
+#include "core/dispatch.h"
+#include "core/tracercore.h"
+#include "module/methods.h"
+#include "support/dbgcommon.h"
+#include "support/dprintf.h"
+#include "threads/threadops.h"
+
+namespace {
+PyObject* gModuleSelf = nullptr;  // owned for the life of the process
+
+bool check_init_arguments(PyObject* const* callbacks, PyObject* import_cb,
+                          PyObject* default_import, PyObject* internal_modules_map) {
+  static const char* const kCallbackErrors[] = {
+      "install_thread_hooks_cb must be callable", "idle_cb must be callable",
+      "line_cb must be callable",                 "return_cb must be callable",
+      "exception_cb must be callable",            "quit_cb must be callable"};
+  for (int i = 0; i < 6; ++i) {
+    if (!PyCallable_Check(callbacks[i])) {
+      PyErr_SetString(PyExc_TypeError, kCallbackErrors[i]);
+      return false;
+    }
+  }
+  if (import_cb != Py_None && !PyCallable_Check(import_cb)) {
+    PyErr_SetString(PyExc_TypeError, "import_cb must be None or callable");
+    return false;
+  }
+  if (!PyCallable_Check(default_import)) {
+    PyErr_SetString(PyExc_TypeError, "default_import must be callable");
+    return false;
+  }
+  if (!PyDict_Check(internal_modules_map)) {
+    PyErr_SetString(PyExc_TypeError, "internal_modules_map must be a dict");
+    return false;
+  }
+  return true;
+}
+}  // namespace
+
+PyObject* _tracer_init(PyObject*, PyObject* args) {
+  do_dprintf(kDbgFlow, "STARTING VANTREL INIT\n");
+  fflush(stdout);
+  fflush(stderr);
+  float idle_period = 0;
+  int exception_mode = 0;
+  PyObject* cbs[6];
+  PyObject *import_cb, *default_import, *dprintf_file, *internal_modules_map;
+  if (!PyArg_ParseTuple(args, "fiOOOOOOOOOO:tracer_init", &idle_period, &exception_mode, &cbs[0],
+                        &cbs[1], &cbs[2], &cbs[3], &cbs[4], &cbs[5], &import_cb, &default_import,
+                        &dprintf_file, &internal_modules_map)) {
+    return nullptr;
+  }
+  if (!check_init_arguments(cbs, import_cb, default_import, internal_modules_map)) return nullptr;
+  if (!__tracer_init(gModuleSelf, idle_period, exception_mode, cbs[0], cbs[1], cbs[2], cbs[3],
+                     cbs[4], cbs[5], import_cb, default_import, dprintf_file,
+                     internal_modules_map)) {
+    return nullptr;
+  }
+  do_dprintf(kDbgFlow, "DONE WITH INIT VANTREL\n");
+  Py_RETURN_NONE;
+}
+
+PyObject* _tracer_reset(PyObject*, PyObject*) {
+  do_dprintf(kDbgFlow, "RESET REACHED\n");
+  __tracer_reset();
+  Py_RETURN_NONE;
+}
+
+PyObject* _tracer_destroy(PyObject*, PyObject*) {
+  do_dprintf(kDbgFlow, "DESTROY REACHED\n");
+  __tracer_destroy();
+  Py_RETURN_NONE;
+}
+
+namespace {
+
+#define METHOD(name, fn, doc) {name, reinterpret_cast<PyCFunction>(fn), METH_VARARGS, PyDoc_STR(doc)}
+
+PyMethodDef gMethods[] = {
+    METHOD("init", _tracer_init, "initialise the core; must come first"),
+    METHOD("reset", _tracer_reset, "reset the core to its blank initial state"),
+    METHOD("destroy", _tracer_destroy, "clear all state and restore the environment"),
+    METHOD("set_autoquit", _tracer_set_autoquit,
+           "0 keeps the debug connection when the bottom frame is left (embedded scripting)"),
+    METHOD("set_idle_period", _tracer_set_idle_period, "seconds between idle callbacks"),
+    METHOD("set_debug_all_threads", _tracer_set_debug_all_threads,
+           "1 debug all threads; 0 only one thread at a time, ignoring the others while one is "
+           "stopped"),
+    METHOD("set_debug_thread_cb", _tracer_set_debug_thread_cb,
+           "per-thread decision callback (0 ignore, 1 stop with the others, 2 stop only at "
+           "breakpoint or exception)"),
+    METHOD("start_trace", _tracer_start_trace,
+           "install the trace function globally and in all frames"),
+    METHOD("stop_trace", _tracer_stop_trace, "remove the trace function, stop debugging"),
+    METHOD("step_into", _tracer_step_into,
+           "step into the next function or to the next instruction"),
+    METHOD("step_over", _tracer_step_over, "step over the next instruction"),
+    METHOD("step_over_line", _tracer_step_over_line, "step over the current line"),
+    METHOD("step_over_line_range", _tracer_step_over_line_range,
+           "step over the given range of lines"),
+    METHOD("step_out", _tracer_step_out, "step out of the current frame"),
+    METHOD("continue_run", _tracer_continue_run, "run freely to the next breakpoint"),
+    METHOD("stop", _tracer_stop, "stop at the next reached location"),
+    METHOD("get_threads", _tracer_get_threads, "ids of all threads known to the core"),
+    METHOD("get_curr_frame", _tracer_get_curr_frame, "the frame where the thread stopped"),
+    METHOD("get_thread_name", _tracer_get_thread_name, "name of the thread's main function"),
+    METHOD("is_botframe", _tracer_is_botframe,
+           "whether the frame is the bottom frame of the calling thread"),
+    METHOD("get_tracing", get_tracing, "whether tracing is active in any thread"),
+    METHOD("add_to_tstate_tracing", add_to_tstate_tracing,
+           "Adds given value to tracing field of the current thread state.  The trace function "
+           "will be called only if tracing == 0.  value can be < 0."),
+    METHOD("get_tstate_tracing", get_tstate_tracing,
+           "Returns current value of tracing field of the current thread state.  The trace "
+           "function will be called only if tracing == 0."),
+    METHOD("set_tstate_use_tracing", set_tstate_use_tracing,
+           "Set value of use_tracing field of the current thread state.  The trace & profile "
+           "functions will be called only if use_tracing != 0.  The field was add in Python 2.3; "
+           "this does nothing in Python 2.0 & 2.1."),
+    METHOD("get_tstate_use_tracing", get_tstate_use_tracing,
+           "Returns current value of use_tracing field of the current thread state.  The trace & "
+           "profile functions will be called only if use_tracing != 0. The field was add in "
+           "Python 2.3; this always returns 1 in Python 2.0 & 2.1."),
+    METHOD("acquire_selvane_mutex", _tracer_acquire_selvane_mutex,
+           "take the mutex that lets only one thread call into the debug server"),
+    METHOD("release_selvane_mutex", _tracer_release_selvane_mutex, "release that mutex"),
+    METHOD("locals_to_fast", locals_to_fast,
+           "Call LocalsToFast on given frame so changes made in the frame locals dict get\nput "
+           "back into the real locals dict"),
+    METHOD("get_frame_file", get_frame_file, "Returns the filename associated with the given frame"),
+    METHOD("get_current_tstate_id", get_current_tstate_id, "Returns id of current thread state"),
+    METHOD("get_thread_ident_for_tstate_id", get_thread_ident_for_tstate_id,
+           "Returns id returned by thread.get_ident for given tstate_id"),
+    METHOD("raise_exception", raise_exception,
+           "Raise given exception in the thread at the next opportunity"),
+    METHOD("is_internal_frame", _tracer_is_internal_frame,
+           "Returns id returned by thread.get_ident for given tstate_id"),
+    METHOD("PyFrame_LocalsToFast", wrap_PyFrame_LocalsToFast,
+           "Wrapper around PyFrame_LocalsToFast internal api call."),
+    // The trace function and the thread hooks carry no docstring.
+    {"trace_dispatch", _tracer_trace_dispatch, METH_VARARGS, nullptr},
+    {"bootstrap_new_thread", _tracer_bootstrap_new_thread, METH_VARARGS, nullptr},
+    {"thread_exiting", _tracer_thread_exiting, METH_VARARGS, nullptr},
+    {nullptr, nullptr, 0, nullptr},
+};
+
+#undef METHOD
+
+PyModuleDef gModuleDef = {
+    PyModuleDef_HEAD_INIT, "tvantrel30pydebugstackless", nullptr, -1, gMethods,
+    nullptr,               nullptr,                      nullptr, nullptr,
+};
+
+// The string makers are looked up by name because their symbol names once depended on the
+// interpreter's build (UCS2 or UCS4); the first name defined wins.
+template <typename Fn>
+Fn lookup_first(const char* const (&names)[3]) {
+  for (const char* name : names) {
+    if (void* address = lookup_python_function(name)) return reinterpret_cast<Fn>(address);
+  }
+  return nullptr;
+}
+
+}  // namespace
+
+PyMODINIT_FUNC PyInit_tvantrel30pydebugstackless(void) {
+  static const char* const kFromString[3] = {"PyUnicodeUCS2_FromString", "PyUnicodeUCS4_FromString",
+                                             "PyUnicode_FromString"};
+  static const char* const kFormatV[3] = {"PyUnicodeUCS2_FromFormatV", "PyUnicodeUCS4_FromFormatV",
+                                          "PyUnicode_FromFormatV"};
+  gPtrTo_PyUnicode_FromString = lookup_first<decltype(gPtrTo_PyUnicode_FromString)>(kFromString);
+  if (gPtrTo_PyUnicode_FromString == nullptr) {
+    PyErr_SetString(PyExc_RuntimeError, "Could not find PyUnicode*_FromString");
+    return nullptr;
+  }
+  gPtrTo_PyUnicode_FormatV = lookup_first<decltype(gPtrTo_PyUnicode_FormatV)>(kFormatV);
+  do_dprintf(kDbgFlow, "Initialize vantrel module started\n");
+  // Single-phase, state in globals: the module cannot be made twice in one process.
+  if (gModuleSelf != nullptr) return Py_NewRef(gModuleSelf);
+  gModuleSelf = PyModule_Create2(&gModuleDef, PYTHON_API_VERSION);
+  if (gModuleSelf == nullptr) return nullptr;
+  init_threadops();
+  init_tracercore();
+  // A forked child is never traced; the handler only sets a flag that the next event reads.
+  pthread_atfork(nullptr, nullptr, note_fork_in_child);
+  do_dprintf(kDbgFlow, "Initialize vantrel module complete\n");
+  return Py_NewRef(gModuleSelf);
+}

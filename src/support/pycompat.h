@@ -1,0 +1,235 @@
+// pycompat.h: everything that differs between the interpreters we support (3.11, 3.12, 3.13).
+//
+// The rest of the core calls these inline accessors and never tests PY_VERSION_HEX itself.
+// Each accessor says whether it returns a borrowed or a new reference. Private thread-state
+// fields are read here and nowhere else; tests/test_compat.py fails on an interpreter where
+// one of them moved or stopped meaning what we rely on.
+#pragma once
+
+#include <Python.h>
+#include <frameobject.h>
+
+#if PY_VERSION_HEX < 0x030B0000
+#error "the debugger core needs CPython 3.11 or later"
+#endif
+#if PY_VERSION_HEX >= 0x030C0000 && PY_VERSION_HEX < 0x030D0000
+#include <opcode.h>
+#endif
+
+#include "support/ref.h"
+
+namespace compat {
+
+// ---- Thread states ---------------------------------------------------------------------
+
+// The calling thread's state, or null when it has none (never a fatal error). Borrowed.
+inline PyThreadState* current_tstate() noexcept {
+#if PY_VERSION_HEX >= 0x030D0000
+  return PyThreadState_GetUnchecked();
+#else
+  return _PyThreadState_UncheckedGet();
+#endif
+}
+
+// The thread's identity as threading.get_ident() reports it (private field).
+inline unsigned long tstate_thread_id(PyThreadState* ts) noexcept { return ts->thread_id; }
+
+// The trace object installed with PyEval_SetTrace in `ts` (private field). Borrowed.
+inline PyObject* tstate_traceobj(PyThreadState* ts) noexcept { return ts->c_traceobj; }
+inline Py_tracefunc tstate_tracefunc(PyThreadState* ts) noexcept { return ts->c_tracefunc; }
+inline bool tstate_has_trace_or_profile(PyThreadState* ts) noexcept {
+  return ts->c_tracefunc != nullptr || ts->c_profilefunc != nullptr;
+}
+
+// Sets the C trace function of another thread. 3.11 and 3.12 export a call for it; 3.13
+// does not, and answers false so that the caller falls back (the thread then installs
+// itself at its next event, or the caller uses set_trace_all_threads).
+inline bool set_trace_for_thread(PyThreadState* ts, Py_tracefunc func, PyObject* obj) noexcept {
+  if (ts == current_tstate()) {
+    PyEval_SetTrace(func, obj);
+    return true;
+  }
+#if PY_VERSION_HEX >= 0x030D0000
+  (void)func;
+  (void)obj;
+  return false;
+#else
+  return _PyEval_SetTrace(ts, func, obj) == 0;
+#endif
+}
+
+// Sets the C trace function of every existing thread at once, where the interpreter has the
+// call (3.12+). Answers false on 3.11, where callers set it thread by thread.
+inline bool set_trace_all_threads(Py_tracefunc func, PyObject* obj) noexcept {
+#if PY_VERSION_HEX >= 0x030C0000
+  PyEval_SetTraceAllThreads(func, obj);
+  return true;
+#else
+  (void)func;
+  (void)obj;
+  return false;
+#endif
+}
+
+// ---- The "tracing" counter and the "use tracing" switch --------------------------------
+//
+// Every supported interpreter skips trace and profile calls while `tracing` is above 0
+// (3.12+ also silences sys.monitoring tools then). 3.11 keeps a separate per-thread flag,
+// `cframe->use_tracing`, that the interpreter recomputes whenever a callback returns or a
+// hook is set, and 3.12+ has no such flag at all. So the switch is built on the counter on
+// every version: switching it off adds one hidden unit to `tracing` (remembered per OS
+// thread), switching it on removes it. The counter that callers read and adjust is the
+// interpreter's minus that hidden unit, so the two contracts stay independent.
+
+namespace detail {
+inline thread_local bool use_tracing_off = false;
+}
+
+// The thread's tracing depth as callers see it (the interpreter's counter without the unit
+// that a switched-off use_tracing holds).
+inline int tracing_get(PyThreadState* ts) noexcept {
+  return ts->tracing - (detail::use_tracing_off ? 1 : 0);
+}
+inline void tracing_add(PyThreadState* ts, int delta) noexcept { ts->tracing += delta; }
+
+// 1 when trace and profile functions would be called in this thread now, else 0.
+inline int use_tracing_get(PyThreadState* ts) noexcept {
+  if (detail::use_tracing_off) return 0;
+  return (ts->tracing == 0 && tstate_has_trace_or_profile(ts)) ? 1 : 0;
+}
+
+// 0 stops trace and profile calls in the calling thread until a non-zero value is set.
+inline void use_tracing_set(PyThreadState* ts, int value) noexcept {
+  bool off = value == 0;
+  if (off == detail::use_tracing_off) return;
+  detail::use_tracing_off = off;
+  if (off) {
+    PyThreadState_EnterTracing(ts);
+  } else {
+    PyThreadState_LeaveTracing(ts);
+  }
+}
+
+// ---- The pending exception -------------------------------------------------------------
+
+// Holds the calling thread's pending exception while the core runs Python code of its own.
+// fetch() takes it out of the thread (clearing it); restore() puts it back, replacing
+// anything raised meanwhile.
+class PendingError {
+ public:
+  void fetch() noexcept {
+#if PY_VERSION_HEX >= 0x030C0000
+    exc_ = PyErr_GetRaisedException();
+#else
+    PyErr_Fetch(&type_, &exc_, &tb_);
+#endif
+  }
+  void restore() noexcept {
+#if PY_VERSION_HEX >= 0x030C0000
+    PyErr_SetRaisedException(exc_);
+#else
+    PyErr_Restore(type_, exc_, tb_);
+    type_ = tb_ = nullptr;
+#endif
+    exc_ = nullptr;
+  }
+  bool empty() const noexcept { return exc_ == nullptr && type_ == nullptr; }
+
+  // Writes the held exception and its traceback to sys.stderr and keeps holding it. Unlike
+  // PyErr_Print this never exits the process on SystemExit and leaves sys.last_* alone:
+  // logging a failure of the core must not change what the program sees.
+  void display() noexcept {
+#if PY_VERSION_HEX >= 0x030C0000
+    if (exc_ != nullptr) PyErr_DisplayException(exc_);
+#else
+    if (type_ == nullptr) return;
+    PyErr_NormalizeException(&type_, &exc_, &tb_);
+    PyErr_Display(type_, exc_, tb_);
+#endif
+  }
+
+ private:
+  PyObject* type_ = nullptr;
+  PyObject* exc_ = nullptr;
+  PyObject* tb_ = nullptr;
+};
+
+// ---- Frames ------------------------------------------------------------------------------
+
+inline bool is_plain_frame(PyObject* obj) noexcept { return Py_IS_TYPE(obj, &PyFrame_Type); }
+
+// The caller of `frame`, or a null Ref at the bottom. New reference.
+inline Ref frame_back(PyFrameObject* frame) noexcept {
+  return Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetBack(frame)));
+}
+
+// The innermost frame of a thread, or a null Ref when it runs none. New reference.
+inline Ref tstate_frame(PyThreadState* ts) noexcept {
+  return Ref::steal(reinterpret_cast<PyObject*>(PyThreadState_GetFrame(ts)));
+}
+
+// Writes a locals mapping edited from C back into the frame's fast locals. From 3.13 on
+// frame.f_locals is a write-through proxy, edits are already in place and the interpreter's
+// call does nothing; it stays callable there, so the behaviour is right on every version.
+inline void locals_to_fast(PyFrameObject* frame, int clear) noexcept {
+  PyFrame_LocalsToFast(frame, clear);
+}
+
+// ---- Return events -----------------------------------------------------------------------
+//
+// A return event whose argument is null means the frame is left by an exception. 3.12.1
+// passes None instead, which looks like `return None`; there the instruction the frame
+// stopped at tells them apart: a frame that really returns or yields stands on
+// RETURN_VALUE, RETURN_CONST or YIELD_VALUE. A generator closed while suspended also stands
+// on YIELD_VALUE while GeneratorExit unwinds it; that case is recognised by the exception
+// event that came just before in the same frame (note_event keeps it, per OS thread).
+
+namespace detail {
+inline thread_local PyFrameObject* last_exception_frame = nullptr;
+}
+
+// Remembers whether the latest event of this thread was an exception event, and where.
+inline void note_event(PyFrameObject* frame, int what) noexcept {
+#if PY_VERSION_HEX >= 0x030C0000 && PY_VERSION_HEX < 0x030D0000
+  detail::last_exception_frame = what == PyTrace_EXCEPTION ? frame : nullptr;
+#else
+  (void)frame;
+  (void)what;
+#endif
+}
+
+#if PY_VERSION_HEX >= 0x030C0000 && PY_VERSION_HEX < 0x030D0000
+inline int opcode_at_lasti(PyFrameObject* frame) noexcept {
+  int lasti = PyFrame_GetLasti(frame);
+  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(frame)));
+  Ref bytes = Ref::steal(PyCode_GetCode(reinterpret_cast<PyCodeObject*>(code.get())));
+  if (!bytes) {
+    PyErr_Clear();
+    return -1;
+  }
+  if (lasti < 0 || lasti >= PyBytes_GET_SIZE(bytes.get())) return -1;
+  return static_cast<unsigned char>(PyBytes_AS_STRING(bytes.get())[lasti]);
+}
+#endif
+
+// The value a return event carries: null when the frame is left by an exception, on every
+// version. Borrowed.
+inline PyObject* return_value_of_event(PyFrameObject* frame, PyObject* arg) noexcept {
+#if PY_VERSION_HEX >= 0x030C0000 && PY_VERSION_HEX < 0x030D0000
+  if (arg != Py_None) return arg;
+  switch (opcode_at_lasti(frame)) {
+    case RETURN_VALUE:
+    case RETURN_CONST:
+      return arg;
+    case YIELD_VALUE:
+      return detail::last_exception_frame == frame ? nullptr : arg;
+    default:
+      return nullptr;
+  }
+#else
+  (void)frame;
+  return arg;
+#endif
+}
+
+}  // namespace compat

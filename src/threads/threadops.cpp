@@ -1,0 +1,165 @@
+// threadops.cpp: thread table, thread identity and thread mutex (see threadops.h).
+#include "threads/threadops.h"
+
+#include <cerrno>
+#include <new>
+#include <vector>
+
+#include "support/dbgcommon.h"
+#include "support/dprintf.h"
+#include "support/pycompat.h"
+
+unsigned long (*gGetThreadIdentFunc)(void) = nullptr;
+
+namespace {
+// Bumped whenever a record leaves a table, so that cached record pointers are never used
+// after the record is freed.
+uint64_t gThreadTableGeneration = 1;
+
+struct CachedRecord {
+  CU_HashTable* table = nullptr;
+  PyThreadState* tstate = nullptr;
+  ThreadData* data = nullptr;
+  uint64_t generation = 0;
+};
+thread_local CachedRecord tCachedRecord;
+}  // namespace
+
+void init_threadops() {
+  gGetThreadIdentFunc = reinterpret_cast<unsigned long (*)(void)>(
+      lookup_python_function("PyThread_get_thread_ident"));
+  do_dprintf(kDbgFlow, "Thread ident function is %p\n",
+             reinterpret_cast<void*>(gGetThreadIdentFunc));
+  if (PyErr_Occurred() != nullptr) PyErr_Clear();
+}
+
+unsigned long get_thread_ident() {
+  return gGetThreadIdentFunc != nullptr ? gGetThreadIdentFunc() : 1;
+}
+
+PyThread_type_lock allocate_thread_mutex() { return PyThread_allocate_lock(); }
+
+int acquire_thread_mutex(PyThread_type_lock lock, int wait) {
+  if (lock == nullptr) return 1;
+  int saved_errno = errno;
+  int acquired = PyThread_acquire_lock(lock, NOWAIT_LOCK);
+  if (!acquired && wait) {
+    // Only the blocking wait runs without the interpreter lock, so the holder of the mutex
+    // can go on running Python code meanwhile.
+    PyThreadState* saved = PyEval_SaveThread();
+    acquired = PyThread_acquire_lock(lock, WAIT_LOCK);
+    PyEval_RestoreThread(saved);
+  }
+  errno = saved_errno;
+  return acquired ? 1 : 0;
+}
+
+void release_thread_mutex(PyThread_type_lock lock) {
+  if (lock == nullptr) return;
+  int saved_errno = errno;
+  PyThread_release_lock(lock);
+  errno = saved_errno;
+}
+
+ThreadData* new_thread_data(PyThreadState* tstate) {
+  ThreadData* data = new (std::nothrow) ThreadData();
+  if (data == nullptr) return nullptr;
+  data->tstate = tstate;
+  data->thread_id = compat::tstate_thread_id(tstate);
+  data->thread_name = Ref::none();
+  data->bot_frame = Ref::none();
+  data->step_out_frame = Ref::none();
+  data->curr_frame = Ref::none();
+  return data;
+}
+
+void free_thread_data(ThreadData* data) {
+  if (data == nullptr) return;
+  data->bot_frame.reset();
+  data->stop_frame.reset();
+  data->step_out_frame.reset();
+  data->curr_frame.reset();
+  data->thread_name.reset();
+  data->sub_language_frame.reset();
+  data->sub_language_hook.reset();
+  data->pending_exception.reset();
+  delete data;
+}
+
+void init_thread_table(CU_HashTable* table) { CU_InitHashTable(table, sizeof(PyThreadState*)); }
+
+ThreadData* find_thread_data(CU_HashTable* table, PyThreadState* tstate) {
+  CU_HashEntry* entry = CU_FindHashEntry(table, &tstate);
+  return entry != nullptr ? static_cast<ThreadData*>(CU_GetHashValue(entry)) : nullptr;
+}
+
+ThreadData* insert_thread_data(CU_HashTable* table, PyThreadState* tstate) {
+  ThreadData* existing = find_thread_data(table, tstate);
+  if (existing != nullptr) return existing;
+  ThreadData* data = new_thread_data(tstate);
+  int is_new = 0;
+  CU_HashEntry* entry = data != nullptr ? CU_CreateHashEntry(table, &tstate, &is_new) : nullptr;
+  if (entry == nullptr) {
+    PyErr_SetString(PyExc_MemoryError, "Out of memory");
+    free_thread_data(data);
+    return nullptr;
+  }
+  CU_SetHashValue(entry, data);
+  return data;
+}
+
+void remove_thread_data(CU_HashTable* table, PyThreadState* tstate) {
+  CU_HashEntry* entry = CU_FindHashEntry(table, &tstate);
+  if (entry == nullptr) return;
+  ThreadData* data = static_cast<ThreadData*>(CU_GetHashValue(entry));
+  // Unlink before releasing: dropping a frame can run finalizers that trace or ask the
+  // table about this thread, and they must not find a half-freed record.
+  CU_DeleteHashEntry(entry);
+  ++gThreadTableGeneration;
+  free_thread_data(data);
+}
+
+void clear_thread_table(CU_HashTable* table) {
+  // Detach every record first, then release them, for the same reason as above.
+  std::vector<ThreadData*> records;
+  records.reserve(table->num_entries);
+  CU_HashSearch search;
+  CU_HashEntry* entry = CU_FirstHashEntry(table, &search);
+  while (entry != nullptr) {
+    records.push_back(static_cast<ThreadData*>(CU_GetHashValue(entry)));
+    CU_HashEntry* done = entry;
+    entry = CU_NextHashEntry(&search);
+    CU_DeleteHashEntry(done);
+  }
+  CU_DeleteHashTable(table);
+  init_thread_table(table);
+  ++gThreadTableGeneration;
+  for (ThreadData* data : records) free_thread_data(data);
+}
+
+ThreadData* get_current_thread_data(CU_HashTable* table) {
+  PyThreadState* tstate = compat::current_tstate();
+  if (tstate == nullptr) return nullptr;
+  ThreadData* data = find_thread_data(table, tstate);
+  if (data != nullptr) data->thread_id = compat::tstate_thread_id(tstate);
+  return data;
+}
+
+PyObject* id_for_tstate_ptr(PyThreadState* tstate) { return PyLong_FromVoidPtr(tstate); }
+
+PyThreadState* tstate_ptr_for_id(PyObject* id) {
+  return static_cast<PyThreadState*>(PyLong_AsVoidPtr(id));
+}
+
+ThreadData* current_thread_data_or_insert(CU_HashTable* table) {
+  PyThreadState* tstate = compat::current_tstate();
+  CachedRecord& cache = tCachedRecord;
+  if (cache.tstate == tstate && cache.table == table &&
+      cache.generation == gThreadTableGeneration && tstate != nullptr) {
+    return cache.data;
+  }
+  if (tstate == nullptr) return nullptr;
+  ThreadData* data = insert_thread_data(table, tstate);
+  if (data != nullptr) cache = CachedRecord{table, tstate, data, gThreadTableGeneration};
+  return data;
+}

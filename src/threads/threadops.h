@@ -1,0 +1,64 @@
+// threadops.h: the table of per-thread debugger records, thread identity and the thread
+// mutex.
+//
+// One ThreadData per interpreter thread the core has seen, keyed by the thread-state
+// pointer's bytes. The interpreter reuses thread-state memory for later threads, so a
+// record found by pointer may belong to an earlier thread until it is removed; the thread
+// start hook removes such a stale record first.
+#pragma once
+
+#include <Python.h>
+#include <pythread.h>
+
+#include <cstdint>
+
+#include "support/hashtable.h"
+#include "support/ref.h"
+
+struct ThreadData {
+  int32_t tracer_in_frames = 0;  // 1 once the tracer was put into the thread's frames
+  int32_t global_trace_set = 0;  // 1 while the thread's C trace function is ours
+  PyThreadState* tstate;         // the key; borrowed, never dereferenced after the thread ends
+  unsigned long thread_id;       // the thread's identity, refreshed on every lookup
+  Ref thread_name;               // owned: name of the thread's main function, or None
+  Ref bot_frame;                 // owned: bottom frame of the debugged code, or None
+  Ref stop_frame;                // owned: null runs freely, None stops anywhere, a frame
+  Ref step_out_frame;            // owned: frame a step-out leaves, or None
+  Ref curr_frame;                // owned: frame of the latest event, None outside the core
+  int32_t line_range_start = -1;  // first line of a stepped-over range, -1 for none
+  int32_t line_range_end = -1;    // last line of that range, -1 for none
+  Ref sub_language_frame;         // owned or null: frame where the sub-language was entered
+  Ref sub_language_hook;          // owned or null: the active sub-language hook object
+  int32_t leaving_bot_frame = 0;  // 1 once an exception left the bottom frame
+  Ref pending_exception;          // owned or null: exception to raise at the next event
+};
+
+// The record of the calling thread, created when missing (null with MemoryError set when it
+// cannot be). Answered from a per-thread cache on the hot path; any removal from the table
+// invalidates every cache.
+ThreadData* current_thread_data_or_insert(CU_HashTable* table);
+
+// The interpreter's thread-identity function, found at load, or null.
+extern unsigned long (*gGetThreadIdentFunc)(void);
+
+void init_threadops();
+unsigned long get_thread_ident();
+
+PyThread_type_lock allocate_thread_mutex();
+int acquire_thread_mutex(PyThread_type_lock lock, int wait);
+void release_thread_mutex(PyThread_type_lock lock);
+
+ThreadData* new_thread_data(PyThreadState* tstate);
+void free_thread_data(ThreadData* data);
+
+void init_thread_table(CU_HashTable* table);
+ThreadData* insert_thread_data(CU_HashTable* table, PyThreadState* tstate);
+ThreadData* find_thread_data(CU_HashTable* table, PyThreadState* tstate);
+void remove_thread_data(CU_HashTable* table, PyThreadState* tstate);
+void clear_thread_table(CU_HashTable* table);
+ThreadData* get_current_thread_data(CU_HashTable* table);
+
+// Thread ids seen by Python code are the thread-state pointers as ints; they round-trip.
+PyObject* id_for_tstate_ptr(PyThreadState* tstate);
+// Null with an error pending when `id` is not an int.
+PyThreadState* tstate_ptr_for_id(PyObject* id);

@@ -1,0 +1,207 @@
+"""A scripted server side for the debugger core, run in a subprocess by the tests.
+
+It initialises the core with recording callbacks, answers each stop with the next command of
+a script, runs a program under the tracer and writes the list of stops as JSON to the file
+named in the configuration. The program's own output and exit status pass through unchanged.
+
+Usage: python scripted_server.py CONFIG.json
+
+Configuration keys:
+  program          path of the program to run as __main__
+  out              path of the JSON file to write the stops to
+  commands         list of commands, one per stop: a method name of the core ("step_into",
+                   "step_over", "step_over_line", "step_out", "continue_run", "stop") or a
+                   list [name, args...] ("step_over_line_range", 3, 5); "raise" raises
+                   RuntimeError from the callback; ["raise_exception", "ValueError", "msg"]
+                   injects an exception; "reset" resets the core from inside the callback
+  default          command used once the list is exhausted (default "continue_run")
+  first            command given before tracing starts (default "step_into")
+  files            only stops in files whose base name is listed are recorded and consume
+                   commands; stops elsewhere are answered with "when_elsewhere" (default:
+                   only the program's file)
+  when_elsewhere   command for stops outside those files (default "step_into")
+  all_files        record stops in every file (the differential tests)
+  debug_all_threads, autoquit, idle_period, exception_mode: run-control settings
+  thread_policy    {"thread name": answer} for debug_thread_cb; unknown threads answer 1
+  fail_in          "line", "return", "exception" or "idle": that callback raises once
+  max_stops        stop recording (and answer continue_run) after this many stops
+
+Callbacks run inside the trace function while other threads may wait on the core's mutex
+without the interpreter lock: they never take a lock another thread may hold (so they do not
+call threading.current_thread(); thread names come from this module's own table).
+"""
+
+import json
+import os
+import runpy
+import sys
+import threading
+
+import tvantrel30pydebugstackless as core
+
+_MAIN_IDENT = threading.get_ident()
+_SELF = os.path.abspath(__file__)
+
+
+class Server:
+    def __init__(self, config):
+        self.config = config
+        self.program = os.path.abspath(config["program"])
+        self.commands = list(config.get("commands", []))
+        self.default = config.get("default", "continue_run")
+        self.when_elsewhere = config.get("when_elsewhere", "step_into")
+        self.files = set(config.get("files", [os.path.basename(self.program)]))
+        self.all_files = config.get("all_files", False)
+        self.max_stops = config.get("max_stops", 100000)
+        self.fail_in = config.get("fail_in")
+        self.stops = []
+        self.events = []  # quit, idle and thread-hook calls, in order
+        self.thread_names = {_MAIN_IDENT: "main"}
+        policy = config.get("thread_policy")
+        self.thread_policy = policy
+
+    # ---- helpers ------------------------------------------------------------------------
+
+    def thread_label(self):
+        return self.thread_names.get(threading.get_ident(), "?")
+
+    def wanted(self, frame):
+        if frame.f_code.co_filename == _SELF:
+            return False
+        if self.all_files:
+            return True
+        return os.path.basename(frame.f_code.co_filename) in self.files
+
+    def where(self, frame):
+        name = os.path.basename(frame.f_code.co_filename)
+        return name, frame.f_lineno, frame.f_code.co_name
+
+    def next_command(self):
+        if self.commands:
+            return self.commands.pop(0)
+        return self.default
+
+    def run_command(self, command):
+        if isinstance(command, str):
+            command = [command]
+        name, args = command[0], command[1:]
+        if name == "raise":
+            raise RuntimeError("callback failure")
+        if name == "raise_exception":
+            exc_type = getattr(__builtins__, args[0], None) or __builtins__[args[0]]
+            core.raise_exception(0, exc_type(*args[1:]))
+            core.step_into()
+            return
+        if name == "reset":
+            core.reset()
+            return
+        getattr(core, name)(*args)
+
+    def stop(self, kind, frame, extra=None):
+        if self.fail_in == kind:
+            self.fail_in = None
+            raise RuntimeError(f"{kind} callback failure")
+        if not self.wanted(frame) or len(self.stops) >= self.max_stops:
+            self.run_command(self.when_elsewhere if len(self.stops) < self.max_stops
+                             else "continue_run")
+            return
+        file, line, func = self.where(frame)
+        record = [kind, file, line, func]
+        if extra is not None:
+            record.append(extra)
+        if self.config.get("record_threads"):
+            record.append(self.thread_label())
+        if self.config.get("record_curr_frame"):
+            tid = core.get_current_tstate_id()
+            record.append(core.get_curr_frame(tid) is frame)
+        self.stops.append(record)
+        self.run_command(self.next_command())
+
+    # ---- callbacks ----------------------------------------------------------------------
+
+    def line_cb(self, frame, changed):
+        self.stop("line", frame)
+
+    def return_cb(self, frame, value, changed):
+        self.stop("return", frame, _summary(value))
+
+    def exception_cb(self, frame, exc_arg, changed):
+        self.stop("exception", frame, exc_arg[0].__name__)
+
+    def quit_cb(self):
+        self.events.append(["quit", self.thread_label()])
+
+    def idle_cb(self):
+        self.events.append(["idle"])
+        if self.fail_in == "idle":
+            self.fail_in = None
+            raise RuntimeError("idle callback failure")
+
+    def install_thread_hooks_cb(self, flag):
+        self.events.append(["thread_hooks", flag])
+        threading.settrace(core.bootstrap_new_thread if flag else None)
+
+    def debug_thread_cb(self, identity):
+        name = self.thread_names.get(identity, "?")
+        answer = self.thread_policy.get(name, 1)
+        if answer == "raise":
+            raise RuntimeError("policy failure")
+        self.events.append(["policy", name, answer])
+        return answer
+
+
+def _summary(value):
+    if value is None or isinstance(value, (int, float, str, bool)):
+        return value
+    return type(value).__name__
+
+
+def _patch_thread_start(server):
+    """Names threads in our own table and tells the core when a thread ends."""
+    original = threading.Thread._bootstrap_inner
+
+    def _bootstrap_inner(self):
+        server.thread_names[threading.get_ident()] = self.name
+        try:
+            original(self)
+        finally:
+            core.thread_exiting()
+
+    threading.Thread._bootstrap_inner = _bootstrap_inner
+
+
+def main(config_path):
+    with open(config_path) as f:
+        config = json.load(f)
+    server = Server(config)
+    _patch_thread_start(server)
+    core.init(float(config.get("idle_period", 0.0)), int(config.get("exception_mode", 0)),
+              server.install_thread_hooks_cb, server.idle_cb, server.line_cb, server.return_cb,
+              server.exception_cb, server.quit_cb, None, __import__, None,
+              {os.path.abspath(__file__): 1})
+    if "debug_all_threads" in config:
+        core.set_debug_all_threads(int(config["debug_all_threads"]))
+    if "autoquit" in config:
+        core.set_autoquit(int(config["autoquit"]))
+    if server.thread_policy is not None:
+        core.set_debug_thread_cb(server.debug_thread_cb)
+    sys.argv = [server.program]
+    status = 0
+    server.run_command(config.get("first", "step_into"))
+    core.start_trace()
+    try:
+        runpy.run_path(server.program, run_name="__main__")
+    except SystemExit as exc:
+        status = exc.code
+        raise
+    finally:
+        core.stop_trace()
+        result = {"stops": server.stops, "events": server.events,
+                  "threads_after": len(core.get_threads())}
+        with open(config["out"], "w") as f:
+            json.dump(result, f)
+    return status
+
+
+if __name__ == "__main__":
+    main(sys.argv[1])
