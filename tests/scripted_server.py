@@ -41,6 +41,7 @@ import tvantrel30pydebugstackless as core
 
 _MAIN_IDENT = threading.get_ident()
 _SELF = os.path.abspath(__file__)
+_NOTHING = object()
 
 
 class Server:
@@ -97,7 +98,7 @@ class Server:
             return
         getattr(core, name)(*args)
 
-    def stop(self, kind, frame, extra=None):
+    def stop(self, kind, frame, extra=_NOTHING):
         if self.fail_in == kind:
             self.fail_in = None
             raise RuntimeError(f"{kind} callback failure")
@@ -107,7 +108,7 @@ class Server:
             return
         file, line, func = self.where(frame)
         record = [kind, file, line, func]
-        if extra is not None:
+        if extra is not _NOTHING:
             record.append(extra)
         if self.config.get("record_threads"):
             record.append(self.thread_label())

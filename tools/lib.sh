@@ -1,9 +1,12 @@
 # Shared helpers of the project's scripts: which interpreters we build for, and making a
 # virtual environment per interpreter with what the build and the tests need.
 set -euo pipefail
+shopt -s inherit_errexit
 
 ROOT="$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)"
-VENVS="$ROOT/.venvs"
+# Several people (or agents) may build side by side: each can name its own folders.
+VENVS="${SELVANE_VENVS:-$ROOT/.venvs}"
+BUILD_PREFIX="${SELVANE_BUILD_PREFIX:-py}"
 PYENV_ROOT="${PYENV_ROOT:-$(pyenv root 2>/dev/null || echo "$HOME/.pyenv")}"
 TARGET_VERSIONS=(3.11.7 3.12.1 3.13.0)
 DEBUG_PYTHON=/usr/bin/python3.11-dbg
@@ -42,7 +45,7 @@ ensure_venv() {  # name -> path of the venv's python
   fi
   if [ ! -f "$venv/.tools-installed" ]; then
     "$venv/bin/python" -m pip install -q --disable-pip-version-check \
-      "scikit-build-core>=0.8" cmake ninja "pytest>=7" >&2
+      "scikit-build-core>=0.8" cmake ninja "pytest>=7" >&2 || return 1
     touch "$venv/.tools-installed"
   fi
   echo "$venv/bin/python"
@@ -53,6 +56,6 @@ install_project() {  # name
   local name="$1" vpy
   vpy="$(ensure_venv "$name")"
   "$vpy" -m pip install -q --disable-pip-version-check --no-build-isolation \
-    --config-settings=build-dir="build/py-$name" "$ROOT" >&2
+    --config-settings=build-dir="build/$BUILD_PREFIX-$name" "$ROOT" >&2 || return 1
   echo "$vpy"
 }

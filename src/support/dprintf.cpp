@@ -48,9 +48,11 @@ Ref format_message(const char* format, va_list args) {
   return message;
 }
 
+// Both steps run whatever happens to the other; their failures are dropped by the caller.
 void write_and_flush(PyObject* file, PyObject* message) {
-  if (message != nullptr) PyFile_WriteObject(message, file, Py_PRINT_RAW);
+  if (message != nullptr && PyFile_WriteObject(message, file, Py_PRINT_RAW) != 0) PyErr_Clear();
   Ref flushed = Ref::steal(PyObject_CallMethod(file, "flush", nullptr));
+  if (!flushed) PyErr_Clear();
 }
 
 }  // namespace
