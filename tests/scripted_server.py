@@ -25,6 +25,15 @@ Configuration keys:
   thread_policy    {"thread name": answer} for debug_thread_cb; unknown threads answer 1
   fail_in          "line", "return", "exception" or "idle": that callback raises once
   max_stops        stop recording (and answer continue_run) after this many stops
+  probe            Python expression evaluated at each recorded stop (names: core, frame,
+                   shared, server, threading); its value is appended to the record
+  prelude          Python source run before tracing starts (names: core, shared, threading)
+  wait_in          {"thread name": seconds}: that thread's first recorded stop waits up to
+                   that long for shared.go (a threading.Event the program sets) and records
+                   whether it came; then probe_after (an expression like probe) is recorded
+
+The program reaches the server's shared state as `import _scripted_shared as shared`
+(attributes: go, a threading.Event; tids, thread name -> tstate id; any others it sets).
 
 Callbacks run inside the trace function while other threads may wait on the core's mutex
 without the interpreter lock: they never take a lock another thread may hold (so they do not
@@ -36,10 +45,15 @@ import os
 import runpy
 import sys
 import threading
+import types
 
 import tvantrel30pydebugstackless as core
 
 _MAIN_IDENT = threading.get_ident()
+shared = types.ModuleType("_scripted_shared")
+shared.go = threading.Event()
+shared.tids = {"main": core.get_current_tstate_id()}
+sys.modules["_scripted_shared"] = shared
 _SELF = os.path.abspath(__file__)
 _NOTHING = object()
 
@@ -58,6 +72,7 @@ class Server:
         self.stops = []
         self.events = []  # quit, idle and thread-hook calls, in order
         self.thread_names = {_MAIN_IDENT: "main"}
+        self.wait_in = dict(config.get("wait_in", {}))
         policy = config.get("thread_policy")
         self.thread_policy = policy
 
@@ -115,6 +130,17 @@ class Server:
         if self.config.get("record_curr_frame"):
             tid = core.get_current_tstate_id()
             record.append(core.get_curr_frame(tid) is frame)
+        if "probe" in self.config:
+            names = {"core": core, "frame": frame, "shared": shared, "server": self,
+                     "threading": threading, "outermost": outermost}
+            record.append(eval(self.config["probe"], names))
+        label = self.thread_label()
+        if label in self.wait_in:
+            record.append(shared.go.wait(self.wait_in.pop(label)))
+            if "probe_after" in self.config:
+                names = {"core": core, "frame": frame, "shared": shared, "server": self,
+                         "threading": threading, "outermost": outermost}
+                record.append(eval(self.config["probe_after"], names))
         self.stops.append(record)
         self.run_command(self.next_command())
 
@@ -145,10 +171,16 @@ class Server:
     def debug_thread_cb(self, identity):
         name = self.thread_names.get(identity, "?")
         answer = self.thread_policy.get(name, 1)
+        self.events.append(["policy", name, answer])
         if answer == "raise":
             raise RuntimeError("policy failure")
-        self.events.append(["policy", name, answer])
         return answer
+
+
+def outermost(frame):
+    while frame.f_back is not None:
+        frame = frame.f_back
+    return frame
 
 
 def _summary(value):
@@ -163,6 +195,7 @@ def _patch_thread_start(server):
 
     def _bootstrap_inner(self):
         server.thread_names[threading.get_ident()] = self.name
+        shared.tids[self.name] = core.get_current_tstate_id()
         try:
             original(self)
         finally:
@@ -186,6 +219,8 @@ def main(config_path):
         core.set_autoquit(int(config["autoquit"]))
     if server.thread_policy is not None:
         core.set_debug_thread_cb(server.debug_thread_cb)
+    if "prelude" in config:
+        exec(config["prelude"], {"core": core, "shared": shared, "threading": threading})
     sys.argv = [server.program]
     status = 0
     server.run_command(config.get("first", "step_into"))

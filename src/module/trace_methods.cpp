@@ -7,6 +7,7 @@
 #include "core/exception_dispatch.h"
 #include "core/install.h"
 #include "core/stepping.h"
+#include "core/thread_policy.h"
 #include "core/tracercore.h"
 #include "module/methods.h"
 #include "support/dprintf.h"
@@ -89,7 +90,16 @@ PyObject* _tracer_bootstrap_new_thread(PyObject* self, PyObject* args) {
 }
 
 PyObject* _tracer_thread_exiting(PyObject*, PyObject*) {
-  remove_thread_data(&gSelf.thread_table, compat::current_tstate());
+  PyThreadState* ts = compat::current_tstate();
+  ThreadData* data = find_thread_data(&gSelf.thread_table, ts);
+  // The thread's last returns must not bring its record back: it stops being traced here.
+  if (data != nullptr && data->global_trace_set) {
+    PyEval_SetTrace(nullptr, nullptr);
+    if (PyErr_Occurred() != nullptr) return nullptr;
+  }
+  remove_thread_data(&gSelf.thread_table, ts);
+  // Thread identities are reused too: a later thread must be asked about afresh.
+  __clear_should_debug_thread_cache(get_thread_ident());
   Py_RETURN_NONE;
 }
 

@@ -124,8 +124,7 @@ const char* __tracer_get_full_path(COPathnameTable* table, PyObject* frame) {
     return nullptr;
   }
   Ref globals = Ref::steal(PyFrame_GetGlobals(plain_frame));
-  const char* relative =
-      __tracer_get_relative_path(table, globals.get(), code_fields->co_filename);
+  const char* relative = __tracer_get_relative_path(table, globals.get(), code_fields->co_filename);
   const char* full = get_absname(table->file_ops, relative);
   if (full == nullptr) {
     do_dprintf(kDbgPathnames, "No full name found for relative name %s\n",

@@ -23,7 +23,7 @@ constexpr int kMaxMatchingDepth = 9;
 // ---- The sweep ---------------------------------------------------------------------------
 
 struct SweepBatch {
-  Ref keys[kSweepBatch];        // owned: the dict keys to delete
+  Ref keys[kSweepBatch];         // owned: the dict keys to delete
   PyObject* codes[kSweepBatch];  // borrowed from the table's own reference
   int count = 0;
 };
@@ -120,8 +120,7 @@ int register_one(COPathnameTable* table, PyObject* code, const char* pathname, i
 }
 
 // Nested functions, classes and lambdas share their parent's file.
-int register_nested_code(COPathnameTable* table, PyObject* code, const char* pathname,
-                         int force) {
+int register_nested_code(COPathnameTable* table, PyObject* code, const char* pathname, int force) {
   if (!PyCode_Check(code)) return 0;
   Ref consts = Ref::borrow(reinterpret_cast<PyCodeObject*>(code)->co_consts);
   if (!consts || !PyTuple_Check(consts.get())) return 0;
@@ -136,7 +135,8 @@ int register_nested_code(COPathnameTable* table, PyObject* code, const char* pat
 // ---- Registering a module's functions ----------------------------------------------------
 
 int register_matching_value(RegisterMatchingContext* context, PyObject* value, int depth) {
-  if (Py_IS_TYPE(value, &PyFunction_Type)) return RegisterMatchingFunction(context, value, depth + 1);
+  if (Py_IS_TYPE(value, &PyFunction_Type))
+    return RegisterMatchingFunction(context, value, depth + 1);
   if (Py_IS_TYPE(value, &PyMethod_Type)) {
     return RegisterMatchingFunction(context, PyMethod_GET_FUNCTION(value), depth + 1);
   }
@@ -277,6 +277,5 @@ int RegisterMatchingFunction(RegisterMatchingContext* context, PyObject* functio
   Ref code = Ref::borrow(PyFunction_GET_CODE(function));
   if (!code || !PyCode_Check(code.get())) return 0;
   if (PyFunction_GET_GLOBALS(function) != context->globals) return 0;
-  return RegisterCOPathname(context->table, code.get(), context->pathname, nullptr,
-                            context->force);
+  return RegisterCOPathname(context->table, code.get(), context->pathname, nullptr, context->force);
 }

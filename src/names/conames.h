@@ -22,8 +22,8 @@ struct COPathnameTable {
   // value: (bytes full path, None). Every key also stands for one reference to the code
   // object that the table took when it registered it.
   Ref dict;
-  int32_t sweep_counter = 0;        // lookups and registrations since the last sweep
-  FileOpsData* file_ops = nullptr;  // borrowed
+  int32_t sweep_counter = 0;               // lookups and registrations since the last sweep
+  FileOpsData* file_ops = nullptr;         // borrowed
   char path_buffer[kMaxPathLen + 1] = {};  // result of __tracer_get_relative_path
   Ref file_key;                            // owned: the str "__file__"
   // Code object address -> the text of its path bytes in `dict` (borrowed from the entry).

@@ -20,7 +20,9 @@ namespace {
 // A failed stat is trusted for less than this many seconds.
 constexpr time_t kNotFoundSeconds = 3;
 
-time_t system_seconds() { return time(nullptr); }
+time_t system_seconds() {
+  return time(nullptr);
+}
 
 // `name` with "c" appended (the compiled file of a source name), malloc'ed. Built on the heap
 // at the name's own length, so no name is too long for it.
@@ -72,8 +74,8 @@ void collapse_parts(char** parts) {
 char* resolve_against_cwd(const char* name) {
   char* cwd = static_cast<char*>(std::malloc(kMaxPathLen + 1));
   if (cwd == nullptr) return nullptr;
-  char* resolved = getcwd(cwd, kMaxPathLen + 1) != nullptr ? resolve_in_directory(cwd, name)
-                                                           : nullptr;
+  char* resolved =
+      getcwd(cwd, kMaxPathLen + 1) != nullptr ? resolve_in_directory(cwd, name) : nullptr;
   std::free(cwd);
   return resolved;
 }
@@ -88,8 +90,7 @@ const char* remember_absname(FileOpsData* data, const char* name, char* full) {
   }
   if (!is_new) std::free(CU_GetHashValue(entry));
   CU_SetHashValue(entry, full);
-  do_dprintf(kDbgPathnames, "resolved %s to %s\n", dprint_check_str(name),
-             dprint_check_str(full));
+  do_dprintf(kDbgPathnames, "resolved %s to %s\n", dprint_check_str(name), dprint_check_str(full));
   return full;
 }
 
@@ -115,7 +116,9 @@ void destroy_file_ops_data(FileOpsData* data) {
   std::free(data);
 }
 
-time_t get_seconds() { return gFileOpsClock(); }
+time_t get_seconds() {
+  return gFileOpsClock();
+}
 
 void mark_not_found(FileOpsData* data, const char* path) {
   int is_new = 0;

@@ -42,7 +42,9 @@ bool ensure_slot(char*** parts, int count, int* capacity) {
 
 }  // namespace
 
-int is_dir_sep(char c) { return c == '/' || c == '\\' ? 1 : 0; }
+int is_dir_sep(char c) {
+  return c == '/' || c == '\\' ? 1 : 0;
+}
 
 const char* find_basename(const char* text) {
   const char* base = text;

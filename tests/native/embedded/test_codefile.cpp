@@ -26,7 +26,9 @@ using testsupport::write_file;
 
 using CodeFileTest = testsupport::TableTest;
 
-Ref str(const std::string& text) { return Ref::steal(PyUnicode_FromString(text.c_str())); }
+Ref str(const std::string& text) {
+  return Ref::steal(PyUnicode_FromString(text.c_str()));
+}
 
 // The frame of a call to f() in code compiled as `filename`. New reference.
 Ref function_frame(PyObject* globals, const std::string& filename) {
@@ -34,7 +36,9 @@ Ref function_frame(PyObject* globals, const std::string& filename) {
   return Ref::borrow(item(globals, "fr"));
 }
 
-std::string text_or_null(const char* text) { return text != nullptr ? text : "(null)"; }
+std::string text_or_null(const char* text) {
+  return text != nullptr ? text : "(null)";
+}
 
 // ---- use_globals_name ----------------------------------------------------------------------
 
@@ -139,8 +143,7 @@ TEST_F(CodeFileTest, OverlongNameBecomesPlaceholder) {
             static_cast<size_t>(kMaxPathLen));
   Ref overlong = str("/" + std::string(kMaxPathLen, 'f'));
   DebugCapture capture;
-  EXPECT_STREQ(__tracer_get_relative_path(table(), nullptr, overlong.get()),
-               "<filename too long>");
+  EXPECT_STREQ(__tracer_get_relative_path(table(), nullptr, overlong.get()), "<filename too long>");
   EXPECT_NE(capture.text().find("FAILURE: File name too long: <filename too long>\n"),
             std::string::npos);
 }

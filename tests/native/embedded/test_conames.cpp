@@ -322,7 +322,8 @@ TEST_F(ConamesTest, ClassesNestedTenDeepAreNotSearched) {
     EXPECT_EQ(LookupCOPathname(table(), function_code(method.get())) != nullptr, expected)
         << "method of C" << level;
     if (level < 12) {
-      cls = Ref::steal(PyObject_GetAttrString(cls.get(), ("C" + std::to_string(level + 1)).c_str()));
+      cls =
+          Ref::steal(PyObject_GetAttrString(cls.get(), ("C" + std::to_string(level + 1)).c_str()));
     }
   }
 }

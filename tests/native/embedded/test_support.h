@@ -55,7 +55,9 @@ inline PyObject* item(PyObject* globals, const char* name) {
   return PyDict_GetItemString(globals, name);
 }
 
-inline PyObject* function_code(PyObject* function) { return PyFunction_GetCode(function); }
+inline PyObject* function_code(PyObject* function) {
+  return PyFunction_GetCode(function);
+}
 
 // A directory under the system's temporary directory, removed with its contents at the end.
 class TempDir {

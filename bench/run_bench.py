@@ -1,0 +1,497 @@
+"""What one trace event costs in the debugger core, against the floor of a C trace function.
+
+Usage: python run_bench.py [--iterations N] [--repeats R] [--only MODE,...] [--json]
+                           [--null-tracer-dir DIR] [--debugpy-python PYTHON]
+
+Runs the workload of workload.py under each mode below, on the interpreter that runs this
+script, and prints the best wall time of R repeats (time.perf_counter), the time per trace
+event, and the ratio to the null C tracer. The modes run in rounds, one repeat of each mode
+per round in a rotating order, so that a slow spell of the machine does not fall on one mode
+only. The garbage collector is off while a repeat runs, as timeit does.
+
+Modes:
+  untraced        no trace function
+  null-c          a C trace function that returns 0 at once (null_tracer/): the floor
+  null-c-locked   the same, taking and releasing one thread lock per event
+  core-free       the core installed and running freely (continue_run, no breakpoint): the
+                  common case of a program under the debugger
+  core-step-over  the core stepping over a call: stopped in a driver frame, the command is
+                  step_over, and the driver then calls the workload, so every event of the
+                  workload is one where the core must find that the stop frame is an outer
+                  frame and answer "no stop"
+  bdb             bdb.Bdb running freely with a breakpoint on a line the workload never
+                  reaches, in the workload's own file (see _FreeRunningBdb)
+  bdb-elsewhere   the same with the breakpoint in another file: bdb then traces no line of
+                  the workload's frames at all; shown to make that shortcut visible, not to
+                  compare like with like
+  debugpy         debugpy (if --debugpy-python names an interpreter that has it) with a
+                  client attached over loopback and a breakpoint on that unreached line; it
+                  runs in a process of its own (see debugpy_child.py)
+
+The number of events is counted once with a sys.settrace counter over one workload call, and
+checked against what the counting variant of the null C tracer sees.
+
+With --json the results also go to results-<python version>.json beside this script.
+"""
+
+import argparse
+import gc
+import json
+import os
+import platform
+import statistics
+import subprocess
+import sys
+import time
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+ROOT = os.path.dirname(HERE)
+sys.path.insert(0, HERE)
+
+import workload as wl  # noqa: E402
+
+perf_counter = time.perf_counter
+VERSION = platform.python_version()
+
+
+class Skip(Exception):
+    """A mode that cannot run here; its message says why."""
+
+
+class Failed(Exception):
+    """A mode that ran but did not behave as the benchmark assumes."""
+
+
+# ---- timing ---------------------------------------------------------------------------------
+
+
+def timed(n):
+    # One line, so that a tracer sees one line event here, before t0 is taken, and none
+    # between the workload's return and t1: a debugger that stops on this frame's lines
+    # (core-step-over) stops outside the measured span.
+    t0 = perf_counter(); wl.workload(n); t1 = perf_counter()  # noqa: E702
+    return t1 - t0
+
+
+def never_reached_line(function):
+    """The last line of a function that nothing calls: where a breakpoint is never hit."""
+    return max(line for _, _, line in function.__code__.co_lines() if line is not None)
+
+
+def _never_called_here():
+    # bdb-elsewhere puts its breakpoint here, in this file, away from the workload's file.
+    return None
+
+
+# ---- modes ----------------------------------------------------------------------------------
+
+
+def mode_untraced(n):
+    return timed(n)
+
+
+def _null_tracer():
+    try:
+        import _null_tracer
+    except ImportError as exc:
+        raise Skip(f"_null_tracer is not built for {VERSION} ({exc}); see null_tracer/build.py")
+    return _null_tracer
+
+
+def mode_null(n):
+    tracer = _null_tracer()
+    tracer.install()
+    try:
+        return timed(n)
+    finally:
+        tracer.uninstall()
+
+
+def mode_null_locked(n):
+    tracer = _null_tracer()
+    tracer.install_locked()
+    try:
+        return timed(n)
+    finally:
+        tracer.uninstall()
+
+
+def _core():
+    try:
+        import tvantrel30pydebugstackless as core
+    except ImportError as exc:
+        raise Skip(f"the core is not installed in this interpreter ({exc})")
+    return core
+
+
+def _noop(*args):
+    return None
+
+
+class _CallbackCounter:
+    """Callbacks that must not be called: the core running freely never stops."""
+
+    def __init__(self):
+        self.calls = {"line": 0, "return": 0, "exception": 0}
+
+    def line(self, frame, changed):
+        self.calls["line"] += 1
+
+    def ret(self, frame, value, changed):
+        self.calls["return"] += 1
+
+    def exc(self, frame, exc_info, changed):
+        self.calls["exception"] += 1
+
+
+def _init_core(core, line_cb, return_cb, exception_cb):
+    core.init(0.0, 0, _noop, _noop, line_cb, return_cb, exception_cb, _noop, None, __import__,
+              None, {})
+
+
+def _check_core_installed(core):
+    if sys.gettrace() is None:
+        raise Failed("start_trace() left the thread without a trace function")
+
+
+def mode_core_free(n):
+    core = _core()
+    counter = _CallbackCounter()
+    _init_core(core, counter.line, counter.ret, counter.exc)
+    core.continue_run()
+    core.start_trace()
+    try:
+        _check_core_installed(core)
+        elapsed = timed(n)
+    finally:
+        core.stop_trace()
+        core.reset()
+    if any(counter.calls.values()):
+        raise Failed(f"the core stopped while running freely: callbacks {counter.calls}")
+    return elapsed
+
+
+def _stepped_driver(n):
+    elapsed = None  # the first stop in this frame: the line callback answers step_over
+    elapsed = timed(n)  # stops here again, and steps over the call
+    return elapsed  # stops here once the workload is done, and continues
+
+
+class _Stepper:
+    """Steps into _stepped_driver, then over the call that runs the workload.
+
+    Stops before the driver are answered with step_into until the driver's first line. There
+    and at the next line the answer is step_over: stop_frame is the driver's frame, and every
+    event of the call that follows (timed() and the workload under it) is one where the core
+    walks from the event's frame outward, meets the stop frame and does not stop. The next
+    stop is the driver's last line, once the workload has returned; it is answered with
+    continue_run.
+    """
+
+    def __init__(self, core):
+        self.core = core
+        self.code = _stepped_driver.__code__
+        self.driver_stops = []  # (event, line relative to the def line)
+        self.other_stops = 0
+
+    def _stop(self, event, frame):
+        if frame.f_code is not self.code:
+            self.other_stops += 1
+            self.core.step_into()
+            return
+        line = frame.f_lineno - self.code.co_firstlineno
+        self.driver_stops.append((event, line))
+        if line < 3:
+            self.core.step_over()
+        else:
+            self.core.continue_run()
+
+    def line(self, frame, changed):
+        self._stop("line", frame)
+
+    def ret(self, frame, value, changed):
+        self._stop("return", frame)
+
+    def exc(self, frame, exc_info, changed):
+        self._stop("exception", frame)
+
+
+def mode_core_step_over(n):
+    core = _core()
+    stepper = _Stepper(core)
+    _init_core(core, stepper.line, stepper.ret, stepper.exc)
+    core.step_into()
+    core.start_trace()
+    try:
+        _check_core_installed(core)
+        elapsed = _stepped_driver(n)
+    finally:
+        core.stop_trace()
+        core.reset()
+    if stepper.driver_stops != [("line", 1), ("line", 2), ("line", 3)]:
+        raise Failed(f"unexpected stops in the driver: {stepper.driver_stops}")
+    return elapsed
+
+
+def _bdb_class():
+    import bdb
+
+    class _FreeRunningBdb(bdb.Bdb):
+        """bdb running freely, the nearest thing to the core's continue_run.
+
+        Bdb.set_continue() removes the trace function when no breakpoint exists, so with no
+        breakpoint bdb costs nothing at all. A debugger session with one breakpoint set,
+        somewhere the program does not reach, is the fair equivalent of the core running
+        freely: bdb keeps tracing, and since the breakpoint's file is the workload's file it
+        traces every line of the workload's frames (stop_here walks to the stop frame,
+        break_here looks the line up). The one stop, at the first line of the traced call
+        and before the timer starts, is answered with set_continue().
+        """
+
+        def __init__(self):
+            super().__init__()
+            self.stops = 0
+
+        def _continue(self):
+            self.stops += 1
+            self.set_continue()
+
+        def user_call(self, frame, argument_list):
+            self._continue()
+
+        def user_line(self, frame):
+            self._continue()
+
+        def user_return(self, frame, return_value):
+            self._continue()
+
+        def user_exception(self, frame, exc_info):
+            self._continue()
+
+    return _FreeRunningBdb
+
+
+def _run_bdb(n, filename, line):
+    debugger = _bdb_class()()
+    error = debugger.set_break(filename, line)
+    if error:
+        raise Failed(f"bdb refused the breakpoint: {error}")
+    elapsed = debugger.runcall(timed, n)
+    if debugger.stops != 1:
+        raise Failed(f"bdb stopped {debugger.stops} times, expected once")
+    return elapsed
+
+
+def mode_bdb(n):
+    return _run_bdb(n, wl.__file__, never_reached_line(wl.never_called))
+
+
+def mode_bdb_elsewhere(n):
+    return _run_bdb(n, __file__, never_reached_line(_never_called_here))
+
+
+MODES = {
+    "untraced": mode_untraced,
+    "null-c": mode_null,
+    "null-c-locked": mode_null_locked,
+    "core-free": mode_core_free,
+    "core-step-over": mode_core_step_over,
+    "bdb": mode_bdb,
+    "bdb-elsewhere": mode_bdb_elsewhere,
+    # debugpy runs in a process of its own: see measure_debugpy().
+}
+FLOOR = "null-c"
+
+
+# ---- event count ----------------------------------------------------------------------------
+
+
+def count_events(n):
+    """The events of one workload(n) call, by kind, as sys.settrace sees them."""
+    counts = {}
+
+    def trace(frame, event, arg):
+        counts[event] = counts.get(event, 0) + 1
+        return trace
+
+    sys.settrace(trace)
+    try:
+        wl.workload(n)
+    finally:
+        sys.settrace(None)
+    return counts
+
+
+def count_events_in_c(n):
+    """What the counting null tracer sees over a timed() call: the workload's events plus the
+    few of timed() itself."""
+    try:
+        tracer = _null_tracer()
+    except Skip:
+        return None
+    tracer.install_counting()
+    try:
+        timed(n)
+    finally:
+        tracer.uninstall()
+    return tracer.counts()
+
+
+# ---- debugpy, in its own process ------------------------------------------------------------
+
+
+def measure_debugpy(python, iterations, repeats):
+    """Runs debugpy_child.py under `python` (an interpreter that has debugpy); returns the
+    list of times, or raises Skip."""
+    if not python:
+        raise Skip("no --debugpy-python given")
+    command = [python, os.path.join(HERE, "debugpy_child.py"), str(iterations), str(repeats)]
+    try:
+        done = subprocess.run(command, capture_output=True, text=True, timeout=600)
+    except (OSError, subprocess.TimeoutExpired) as exc:
+        raise Skip(f"debugpy run failed: {exc}")
+    if done.returncode != 0:
+        tail = (done.stderr.strip().splitlines() or ["(no output)"])[-1]
+        raise Skip(f"debugpy run failed: {tail}")
+    result = json.loads(done.stdout.strip().splitlines()[-1])
+    if "skip" in result:
+        raise Skip(result["skip"])
+    return result["times"]
+
+
+# ---- driver ---------------------------------------------------------------------------------
+
+
+def run_once(mode, n):
+    gc.collect()
+    gc.disable()
+    try:
+        return MODES[mode](n)
+    finally:
+        gc.enable()
+
+
+def measure(modes, iterations, repeats):
+    """Times each mode `repeats` times in rotating rounds, after one warm-up run each.
+    Returns {mode: list of seconds} and {mode: reason} for the modes that were skipped."""
+    times = {mode: [] for mode in modes}
+    skipped = {}
+    for mode in modes:  # warm-up: first-run costs (imports, instrumenting code) stay out
+        try:
+            run_once(mode, iterations)
+        except Skip as exc:
+            skipped[mode] = str(exc)
+    active = [mode for mode in modes if mode not in skipped]
+    for round_number in range(repeats):
+        shift = round_number % len(active) if active else 0
+        for mode in active[shift:] + active[:shift]:
+            times[mode].append(run_once(mode, iterations))
+    return {mode: times[mode] for mode in active}, skipped
+
+
+def summarise(times, events):
+    floor = min(times[FLOOR]) if FLOOR in times else None
+    rows = {}
+    for mode, values in times.items():
+        best = min(values)
+        rows[mode] = {
+            "best_s": best,
+            "median_s": statistics.median(values),
+            "ns_per_event": best / events * 1e9,
+            "ns_per_event_above_floor": (best - floor) / events * 1e9 if floor else None,
+            "ratio_to_floor": best / floor if floor else None,
+            "times_s": values,
+        }
+    return rows
+
+
+def print_table(rows, skipped, events, counts, c_counts, iterations, repeats):
+    kinds = ", ".join(f"{kind} {count}" for kind, count in sorted(counts.items()))
+    print(f"CPython {VERSION} ({platform.machine()}), {iterations} iterations, "
+          f"{events} events per run ({kinds}), best of {repeats}")
+    if c_counts is not None:
+        seen = sum(c_counts.values())
+        print(f"  the counting C tracer saw {seen} events over the timed span "
+              f"({seen - events:+d}: the timing line's own events)")
+    header = (f"{'mode':<16}{'best s':>10}{'median s':>10}{'ns/event':>10}"
+              f"{'+ns over null':>15}{'x null':>8}")
+    print(header)
+    print("-" * len(header))
+    for mode, row in rows.items():
+        above = row["ns_per_event_above_floor"]
+        ratio = row["ratio_to_floor"]
+        print(f"{mode:<16}{row['best_s']:>10.4f}{row['median_s']:>10.4f}"
+              f"{row['ns_per_event']:>10.1f}"
+              f"{(f'{above:+.1f}' if above is not None else '-'):>15}"
+              f"{(f'{ratio:.2f}' if ratio is not None else '-'):>8}")
+    for mode, reason in skipped.items():
+        print(f"{mode:<16}skipped: {reason}")
+
+
+def main(argv=None):
+    parser = argparse.ArgumentParser(description=__doc__.splitlines()[0])
+    parser.add_argument("--iterations", type=int, default=50_000,
+                        help="loop iterations of the workload (6 events each)")
+    parser.add_argument("--repeats", type=int, default=7, help="timed runs per mode")
+    parser.add_argument("--only", default="",
+                        help="comma-separated modes to run (default: all)")
+    parser.add_argument("--json", action="store_true",
+                        help=f"also write results-{VERSION}.json beside this script")
+    parser.add_argument("--null-tracer-dir",
+                        default=os.path.join(ROOT, "build", f"bench-null-tracer-{VERSION}"),
+                        help="folder that holds the built _null_tracer extension")
+    parser.add_argument("--debugpy-python", default="",
+                        help="interpreter (same version) that has debugpy installed")
+    args = parser.parse_args(argv)
+
+    sys.path.insert(0, args.null_tracer_dir)
+    wanted = [m for m in args.only.split(",") if m] or list(MODES) + ["debugpy"]
+    unknown = [m for m in wanted if m not in MODES and m != "debugpy"]
+    if unknown:
+        parser.error(f"unknown modes {unknown}; known: {list(MODES) + ['debugpy']}")
+
+    counts = count_events(args.iterations)
+    events = sum(counts.values())
+    c_counts = count_events_in_c(args.iterations)
+    if c_counts is not None and not 0 <= sum(c_counts.values()) - events <= 8:
+        print(f"warning: the C tracer saw {c_counts}, sys.settrace saw {counts}",
+              file=sys.stderr)
+
+    try:
+        times, skipped = measure([m for m in wanted if m in MODES], args.iterations,
+                                 args.repeats)
+    except Failed as exc:
+        print(f"error: {exc}", file=sys.stderr)
+        return 1
+    if "debugpy" in wanted:
+        try:
+            times["debugpy"] = measure_debugpy(args.debugpy_python, args.iterations,
+                                               args.repeats)
+        except Skip as exc:
+            skipped["debugpy"] = str(exc)
+    rows = summarise(times, events)
+    print_table(rows, skipped, events, counts, c_counts, args.iterations, args.repeats)
+
+    if args.json:
+        path = os.path.join(HERE, f"results-{VERSION}.json")
+        with open(path, "w") as f:
+            json.dump({
+                "python": VERSION,
+                "implementation": platform.python_implementation(),
+                "machine": platform.machine(),
+                "cpus": os.cpu_count(),
+                "iterations": args.iterations,
+                "repeats": args.repeats,
+                "events_per_run": events,
+                "events_by_kind": counts,
+                "floor": FLOOR,
+                "modes": rows,
+                "skipped": skipped,
+            }, f, indent=2)
+            f.write("\n")
+        print(f"wrote {path}")
+    return 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())
