@@ -257,7 +257,10 @@ def _bdb_class():
             self.set_continue()
 
         def user_call(self, frame, argument_list):
-            self._continue()
+            # Bdb calls this at every call in a file with a breakpoint and leaves the
+            # decision to the subclass, as pdb does it: stop only where stop_here() says so.
+            if self.stop_here(frame):
+                self._continue()
 
         def user_line(self, frame):
             self._continue()
@@ -276,7 +279,12 @@ def _run_bdb(n, filename, line):
     error = debugger.set_break(filename, line)
     if error:
         raise Failed(f"bdb refused the breakpoint: {error}")
-    elapsed = debugger.runcall(timed, n)
+    try:
+        elapsed = debugger.runcall(timed, n)
+    finally:
+        # Breakpoints are global to the Bdb class: a new instance loads those of the old
+        # ones, and the next run must see only its own.
+        debugger.clear_all_breaks()
     if debugger.stops != 1:
         raise Failed(f"bdb stopped {debugger.stops} times, expected once")
     return elapsed

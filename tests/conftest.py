@@ -29,6 +29,8 @@ class Run:
     stops: list = field(default_factory=list)
     events: list = field(default_factory=list)
     threads_after: int = -1
+    tracing_after_stop: int = -1
+    after_stop: object = None
 
 
 def write_program(tmp_path, source, name="prog.py"):
@@ -55,6 +57,8 @@ def run_traced(tmp_path, program, **config):
         run.stops = [tuple(s) for s in data["stops"]]
         run.events = data["events"]
         run.threads_after = data["threads_after"]
+        run.tracing_after_stop = data["tracing_after_stop"]
+        run.after_stop = data.get("after_stop")
     elif proc.returncode < 0 or "Fatal Python error" in proc.stderr:
         pytest.fail(f"traced run crashed ({proc.returncode}):\n{proc.stderr}")
     return run

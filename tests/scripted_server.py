@@ -11,7 +11,8 @@ Configuration keys:
   out              path of the JSON file to write the stops to
   commands         list of commands, one per stop: a method name of the core ("step_into",
                    "step_over", "step_over_line", "step_out", "continue_run", "stop") or a
-                   list [name, args...] ("step_over_line_range", 3, 5); "raise" raises
+                   list [name, args...] ("step_over_line_range", 3, 5); ["seq", c1, c2]
+                   runs several commands in one stop; "raise" raises
                    RuntimeError from the callback; ["raise_exception", "ValueError", "msg"]
                    injects an exception; "reset" resets the core from inside the callback
   default          command used once the list is exhausted (default "continue_run")
@@ -20,7 +21,8 @@ Configuration keys:
                    commands; stops elsewhere are answered with "when_elsewhere" (default:
                    only the program's file)
   when_elsewhere   command for stops outside those files (default "step_into")
-  all_files        record stops in every file (the differential tests)
+  all_files        record stops in every file once the program runs, not in the code the
+                   server side itself runs while it starts tracing (the differential tests)
   debug_all_threads, autoquit, idle_period, exception_mode: run-control settings
   thread_policy    {"thread name": answer} for debug_thread_cb; unknown threads answer 1
   fail_in          "line", "return", "exception" or "idle": that callback raises once
@@ -28,6 +30,11 @@ Configuration keys:
   probe            Python expression evaluated at each recorded stop (names: core, frame,
                    shared, server, threading); its value is appended to the record
   prelude          Python source run before tracing starts (names: core, shared, threading)
+  after_stop       Python expression evaluated right after stop_trace (names: core, shared,
+                   sys, threading); its value is written as "after_stop"
+  stop_in_atexit   stop tracing (and write the results) only at exit, after the server's
+                   own bottom frame has returned
+  debug_file       path of the core's debug output file
   wait_in          {"thread name": seconds}: that thread's first recorded stop waits up to
                    that long for shared.go (a threading.Event the program sets) and records
                    whether it came; then probe_after (an expression like probe) is recorded
@@ -40,6 +47,8 @@ without the interpreter lock: they never take a lock another thread may hold (so
 call threading.current_thread(); thread names come from this module's own table).
 """
 
+import atexit
+import builtins
 import json
 import os
 import runpy
@@ -67,6 +76,7 @@ class Server:
         self.when_elsewhere = config.get("when_elsewhere", "step_into")
         self.files = set(config.get("files", [os.path.basename(self.program)]))
         self.all_files = config.get("all_files", False)
+        self.program_running = False  # set once tracing is on and the program starts
         self.max_stops = config.get("max_stops", 100000)
         self.fail_in = config.get("fail_in")
         self.stops = []
@@ -85,7 +95,7 @@ class Server:
         if frame.f_code.co_filename == _SELF:
             return False
         if self.all_files:
-            return True
+            return self.program_running
         return os.path.basename(frame.f_code.co_filename) in self.files
 
     def where(self, frame):
@@ -101,11 +111,17 @@ class Server:
         if isinstance(command, str):
             command = [command]
         name, args = command[0], command[1:]
+        if name == "seq":
+            for part in args:
+                self.run_command(part)
+            return
         if name == "raise":
             raise RuntimeError("callback failure")
         if name == "raise_exception":
-            exc_type = getattr(__builtins__, args[0], None) or __builtins__[args[0]]
-            core.raise_exception(0, exc_type(*args[1:]))
+            if args[0] is None:
+                core.raise_exception(0, None)
+            else:
+                core.raise_exception(0, getattr(builtins, args[0])(*args[1:]))
             core.step_into()
             return
         if name == "reset":
@@ -209,9 +225,11 @@ def main(config_path):
         config = json.load(f)
     server = Server(config)
     _patch_thread_start(server)
+    shared.server = server
+    debug_file = open(config["debug_file"], "w") if "debug_file" in config else None
     core.init(float(config.get("idle_period", 0.0)), int(config.get("exception_mode", 0)),
               server.install_thread_hooks_cb, server.idle_cb, server.line_cb, server.return_cb,
-              server.exception_cb, server.quit_cb, None, __import__, None,
+              server.exception_cb, server.quit_cb, None, __import__, debug_file,
               {os.path.abspath(__file__): 1})
     if "debug_all_threads" in config:
         core.set_debug_all_threads(int(config["debug_all_threads"]))
@@ -222,21 +240,30 @@ def main(config_path):
     if "prelude" in config:
         exec(config["prelude"], {"core": core, "shared": shared, "threading": threading})
     sys.argv = [server.program]
-    status = 0
+    # As `python program.py` does: the program's folder comes first on the import path.
+    sys.path.insert(0, os.path.dirname(server.program))
     server.run_command(config.get("first", "step_into"))
     core.start_trace()
+    server.program_running = True
+    if config.get("stop_in_atexit"):
+        atexit.register(finish, server, config)
+        runpy.run_path(server.program, run_name="__main__")
+        return
     try:
         runpy.run_path(server.program, run_name="__main__")
-    except SystemExit as exc:
-        status = exc.code
-        raise
     finally:
-        core.stop_trace()
-        result = {"stops": server.stops, "events": server.events,
-                  "threads_after": len(core.get_threads())}
-        with open(config["out"], "w") as f:
-            json.dump(result, f)
-    return status
+        finish(server, config)
+
+
+def finish(server, config):
+    core.stop_trace()
+    result = {"stops": server.stops, "events": server.events,
+              "threads_after": len(core.get_threads()), "tracing_after_stop": core.get_tracing()}
+    if "after_stop" in config:
+        names = {"core": core, "shared": shared, "sys": sys, "threading": threading}
+        result["after_stop"] = eval(config["after_stop"], names)
+    with open(config["out"], "w") as f:
+        json.dump(result, f)
 
 
 if __name__ == "__main__":

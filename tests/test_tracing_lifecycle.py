@@ -1,0 +1,319 @@
+"""Switching tracing on and off, containment of failures, injected exceptions, the idle
+callback, autoquit and forked children. Every traced program runs in a subprocess."""
+
+import sys
+
+import pytest
+
+from conftest import assert_stops, ok, run_plain, run_traced
+
+import tvantrel30pydebugstackless as core
+
+SIMPLE = """
+    def f(x):
+        y = x * 2
+        return y
+
+    total = f(1) + f(2)
+    print(total)
+"""
+
+# ---- stop_trace and reset -----------------------------------------------------------------
+
+LINGERING = """
+    import sys
+    import threading
+    import _scripted_shared as shared
+
+    def foreign(frame, event, arg):
+        return foreign
+
+    def linger():
+        shared.release.wait(30)
+
+    def main():
+        shared.release = threading.Event()
+        shared.thread = threading.Thread(target=linger, name="linger")
+        shared.thread.start()
+        sys._getframe().f_trace = foreign   # set while tracing: must survive stop_trace
+        print("main done")
+
+    main()
+"""
+
+# Collects, for every frame of every thread after stop_trace, which kind of f_trace it has;
+# then lets the lingering thread end.
+FRAMES_AFTER_STOP = (
+    "[sorted({(('ours' if f.f_trace is core.trace_dispatch else "
+    "'foreign' if getattr(f.f_trace, '__name__', '') == 'foreign' else 'none'))"
+    " for top in sys._current_frames().values() for f in __import__('traceback').walk_stack(top)"
+    " for f in [f[0]]}), shared.release.set(), shared.thread.join()][0]"
+)
+
+
+def test_stop_trace_leaves_no_trace_dispatch_in_any_frame(tmp_path):
+    run = ok(run_traced(tmp_path, LINGERING, first="continue_run", after_stop=FRAMES_AFTER_STOP))
+    assert run.after_stop == ["none"]
+    assert run.stdout == "main done\n"
+
+
+def test_stop_trace_leaves_foreign_trace_functions(tmp_path):
+    program = """
+        import sys
+        import _scripted_shared as shared
+
+        def foreign(frame, event, arg):
+            return foreign
+
+        def keep():
+            frame = sys._getframe()
+            frame.f_trace = foreign
+            shared.kept = frame
+            return 1
+
+        keep()
+    """
+    run = ok(run_traced(tmp_path, program, first="continue_run",
+                        after_stop="shared.kept.f_trace.__name__"))
+    assert run.after_stop == "foreign"
+
+
+def test_get_tracing_stays_one_after_stop_trace(tmp_path):
+    run = ok(run_traced(tmp_path, SIMPLE, first="continue_run"))
+    assert run.tracing_after_stop == 1
+    assert run.threads_after >= 1
+
+
+def test_reset_from_a_callback_stops_tracing_everywhere(tmp_path):
+    program = """
+        import threading
+
+        def work():
+            try:
+                raise ValueError(1)
+            except ValueError:
+                pass
+
+        t = threading.Thread(target=work, name="w")
+        t.start()
+        t.join()
+        print("done")
+    """
+    # Exception mode 1 would stop the worker at its exception; line 1 steps on, line 3
+    # resets the core: nothing stops after that, in this thread or in the worker.
+    run = ok(run_traced(tmp_path, program, exception_mode=1, commands=["step_into", "reset"],
+                        record_threads=True))
+    assert_stops(run.stops, [("line", "prog.py", 1, "<module>", "main"),
+                             ("line", "prog.py", 3, "<module>", "main")])
+    assert run.stdout == "done\n"
+
+
+def test_start_trace_twice_installs_once(tmp_path):
+    twice, once = tmp_path / "twice.txt", tmp_path / "once.txt"
+    ok(run_traced(tmp_path, SIMPLE, first="continue_run", prelude="core.start_trace()",
+                  debug_file=str(twice)))
+    ok(run_traced(tmp_path, SIMPLE, first="continue_run", debug_file=str(once)))
+    twice, once = twice.read_text(), once.read_text()
+    assert twice.count("START TRACING\n") == 2
+    assert once.count("START TRACING\n") == 1
+    # Frames are walked after the first start only.
+    first, second = twice.split("START TRACING\n")[1:]
+    assert "inserting into thread state" in first
+    assert "inserting into thread state" not in second.split("in __tracer_stop_trace()")[0]
+
+
+# ---- failures are contained ---------------------------------------------------------------
+
+RAISING = """
+    def f():
+        try:
+            raise ValueError("mine")
+        except ValueError as exc:
+            print("caught", exc)
+        return 5
+
+    print(f())
+"""
+
+
+@pytest.mark.parametrize("where, stop_line", [
+    ("line", "TRACER LINE STOPPED TRACER\n"),
+    ("return", "TRACER RETURN STOPPED TRACER\n"),
+    ("exception", "TRACER EXC STOPPED TRACER\n"),
+])
+def test_failing_callback_switches_tracing_off_for_the_thread(tmp_path, where, stop_line):
+    log = tmp_path / "debug.txt"
+    run = run_traced(tmp_path, RAISING, fail_in=where, exception_mode=1, debug_file=str(log),
+                     default="step_into")
+    plain = run_plain(tmp_path, RAISING)
+    # The program neither sees the failure nor loses its own exception.
+    assert (run.returncode, run.stdout) == (plain.returncode, plain.stdout)
+    assert stop_line in log.read_text()
+    assert f"{where} callback failure" in run.stderr  # reported, as an unraisable error
+    assert run.stops == []  # the failing callback recorded nothing, and nothing stopped later
+
+
+def test_failing_idle_callback_is_logged_and_tracing_goes_on(tmp_path):
+    program = """
+        import time
+
+        def spin(seconds):
+            end = time.time() + seconds
+            n = 0
+            while time.time() < end:
+                n += 1
+            return n
+
+        print(spin(1.3) > 0)
+    """
+    log = tmp_path / "debug.txt"
+    run = ok(run_traced(tmp_path, program, first="continue_run", idle_period=0.1, fail_in="idle",
+                        debug_file=str(log)))
+    assert run.stdout == "True\n"
+    assert "idle callback failure" in log.read_text()
+    assert len([e for e in run.events if e == ["idle"]]) >= 2
+
+
+# ---- injected exceptions ------------------------------------------------------------------
+
+INJECT = """
+    try:
+        x = 1
+        y = 2
+        z = 3
+    except ValueError as exc:
+        print("caught", exc)
+    else:
+        print("no exception")
+"""
+
+
+def test_raise_exception_is_raised_at_the_next_event(tmp_path):
+    run = ok(run_traced(tmp_path, INJECT, commands=["step_into", ["raise_exception", "ValueError",
+                                                                  "injected"]],
+                        default="continue_run"))
+    # Injected while stopped at line 2; the next event (line 3) raises it before y = 2 runs,
+    # and the stepping thread stops at that exception.
+    assert_stops(run.stops, [("line", "prog.py", 1, "<module>"), ("line", "prog.py", 2, "<module>"),
+                             ("exception", "prog.py", 3, "<module>", "ValueError")])
+    assert run.stdout == "caught injected\n"
+
+
+def test_raise_exception_none_clears_the_pending_exception(tmp_path):
+    run = ok(run_traced(tmp_path, INJECT, default="continue_run",
+                        commands=["step_into", ["seq", ["raise_exception", "ValueError", "x"],
+                                                ["raise_exception", None]]]))
+    assert run.stdout == "no exception\n"
+
+
+def test_raise_exception_rejects_bad_arguments():
+    with pytest.raises(TypeError):
+        core.raise_exception(0, 5)
+    with pytest.raises(TypeError):
+        core.raise_exception("thread", ValueError())
+    with pytest.raises(TypeError):
+        core.raise_exception(0)
+
+
+# ---- idle and quit ------------------------------------------------------------------------
+
+SPIN = """
+    import time
+
+    def spin(seconds):
+        end = time.time() + seconds
+        n = 0
+        while time.time() < end:
+            n += 1
+        return n
+
+    spin(2.4)
+    print("spun")
+"""
+
+
+def test_idle_callback_runs_at_most_once_a_second(tmp_path):
+    run = ok(run_traced(tmp_path, SPIN, first="continue_run", idle_period=0.5))
+    idles = len([e for e in run.events if e == ["idle"]])
+    assert 1 <= idles <= 4  # 2.4 s of events: at most one call per started second
+
+
+def test_idle_period_zero_never_calls_the_idle_callback(tmp_path):
+    run = ok(run_traced(tmp_path, SPIN, first="continue_run", idle_period=0.0))
+    assert ["idle"] not in run.events
+
+
+def test_quit_callback_when_the_bottom_frame_returns(tmp_path):
+    run = ok(run_traced(tmp_path, SIMPLE, first="continue_run", autoquit=1, stop_in_atexit=True))
+    quits = [e for e in run.events if e[0] == "quit"]
+    # The server's own module frame is the bottom frame: it returns once the program has
+    # run. Code that runs after it (interpreter shutdown) gets a new bottom frame, whose
+    # return quits again.
+    assert quits and set(map(tuple, quits)) == {("quit", "main")}
+    assert run.stdout == "6\n"
+
+
+def test_no_quit_callback_without_autoquit(tmp_path):
+    run = ok(run_traced(tmp_path, SIMPLE, first="continue_run", autoquit=0, stop_in_atexit=True))
+    assert [e for e in run.events if e[0] == "quit"] == []
+
+
+# ---- forked children ----------------------------------------------------------------------
+
+FORK = """
+    import os
+    import _scripted_shared as shared
+
+    def lines():
+        a = 1
+        b = 2
+        return a + b
+
+    read_end, write_end = os.pipe()
+    pid = os.fork()
+    if pid == 0:
+        before = len(shared.server.stops)
+        lines()
+        os.write(write_end, str(len(shared.server.stops) - before).encode())
+        os._exit(0)
+    os.waitpid(pid, 0)
+    print("child stops:", os.read(read_end, 100).decode())
+    before = len(shared.server.stops)
+    lines()
+    print("parent stops:", len(shared.server.stops) - before)
+"""
+
+
+def test_forked_child_is_not_traced(tmp_path):
+    run = ok(run_traced(tmp_path, FORK, default="step_into"))
+    child, parent = run.stdout.splitlines()
+    assert child == "child stops: 0"
+    assert parent != "parent stops: 0"
+
+
+# ---- the program does not notice the debugger ---------------------------------------------
+
+EXIT_STATUS = """
+    import sys
+    print("before")
+    sys.exit(3)
+"""
+
+
+def test_exit_status_and_output_pass_through(tmp_path):
+    for program in (SIMPLE, EXIT_STATUS, RAISING):
+        traced = run_traced(tmp_path, program, default="step_into")
+        plain = run_plain(tmp_path, program)
+        assert (traced.returncode, traced.stdout) == (plain.returncode, plain.stdout)
+
+
+def test_uncaught_exception_exit_status_passes_through(tmp_path):
+    program = """
+        def boom():
+            raise KeyError("gone")
+        boom()
+    """
+    traced = run_traced(tmp_path, program, default="step_into")
+    plain = run_plain(tmp_path, program)
+    assert traced.returncode == plain.returncode == 1
+    assert traced.stderr.strip().splitlines()[-1] == plain.stderr.strip().splitlines()[-1]
