@@ -73,6 +73,12 @@ def timed(n):
     return t1 - t0
 
 
+def use_callgrind_clock():
+    """Makes timed() switch callgrind's collection on and off around the workload."""
+    global perf_counter
+    perf_counter = _null_tracer().callgrind_clock
+
+
 def never_reached_line(function):
     """The last line of a function that nothing calls: where a breakpoint is never hit."""
     return max(line for _, _, line in function.__code__.co_lines() if line is not None)
@@ -350,7 +356,7 @@ def count_events_in_c(n):
 
 def measure_debugpy(python, iterations, repeats):
     """Runs debugpy_child.py under `python` (an interpreter that has debugpy); returns the
-    list of times, or raises Skip."""
+    list of times and a note on how debugpy traced, or raises Skip."""
     if not python:
         raise Skip("no --debugpy-python given")
     command = [python, os.path.join(HERE, "debugpy_child.py"), str(iterations), str(repeats)]
@@ -364,7 +370,7 @@ def measure_debugpy(python, iterations, repeats):
     result = json.loads(done.stdout.strip().splitlines()[-1])
     if "skip" in result:
         raise Skip(result["skip"])
-    return result["times"]
+    return result["times"], f"debugpy {result['debugpy']} traced through {result['tracer']}"
 
 
 # ---- driver ---------------------------------------------------------------------------------
@@ -375,6 +381,17 @@ def run_once(mode, n):
     gc.disable()
     try:
         return MODES[mode](n)
+    finally:
+        gc.enable()
+
+
+def run_once_timed(n):
+    """One timed() run on the same terms as run_once(), for a tracer installed by the caller
+    (debugpy_child.py)."""
+    gc.collect()
+    gc.disable()
+    try:
+        return timed(n)
     finally:
         gc.enable()
 
@@ -450,6 +467,9 @@ def main(argv=None):
                         help="folder that holds the built _null_tracer extension")
     parser.add_argument("--debugpy-python", default="",
                         help="interpreter (same version) that has debugpy installed")
+    parser.add_argument("--under-callgrind", action="store_true",
+                        help="(used by count_instructions.py) let callgrind collect only "
+                             "the timed spans")
     args = parser.parse_args(argv)
 
     sys.path.insert(0, args.null_tracer_dir)
@@ -460,7 +480,9 @@ def main(argv=None):
 
     counts = count_events(args.iterations)
     events = sum(counts.values())
-    c_counts = count_events_in_c(args.iterations)
+    c_counts = None if args.under_callgrind else count_events_in_c(args.iterations)
+    if args.under_callgrind:
+        use_callgrind_clock()
     if c_counts is not None and not 0 <= sum(c_counts.values()) - events <= 8:
         print(f"warning: the C tracer saw {c_counts}, sys.settrace saw {counts}",
               file=sys.stderr)
@@ -471,14 +493,17 @@ def main(argv=None):
     except Failed as exc:
         print(f"error: {exc}", file=sys.stderr)
         return 1
-    if "debugpy" in wanted:
+    notes = {}
+    if "debugpy" in wanted and not args.under_callgrind:
         try:
-            times["debugpy"] = measure_debugpy(args.debugpy_python, args.iterations,
-                                               args.repeats)
+            times["debugpy"], notes["debugpy"] = measure_debugpy(
+                args.debugpy_python, args.iterations, args.repeats)
         except Skip as exc:
             skipped["debugpy"] = str(exc)
     rows = summarise(times, events)
     print_table(rows, skipped, events, counts, c_counts, args.iterations, args.repeats)
+    for mode, note in notes.items():
+        print(f"{mode}: {note}")
 
     if args.json:
         path = os.path.join(HERE, f"results-{VERSION}.json")
@@ -495,6 +520,7 @@ def main(argv=None):
                 "floor": FLOOR,
                 "modes": rows,
                 "skipped": skipped,
+                "notes": notes,
             }, f, indent=2)
             f.write("\n")
         print(f"wrote {path}")

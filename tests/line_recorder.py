@@ -3,8 +3,9 @@
 Usage: python line_recorder.py PROGRAM OUT.json
 
 It mirrors scripted_server.py's way of running the program (runpy.run_path as __main__
-after setting sys.argv) so that the two runs execute the same code, and records every line
-event of the main thread outside this file.
+after setting sys.argv and putting the program's folder first on sys.path) so that the two
+runs execute the same code, and records every line event of the main thread outside this
+file.
 """
 
 import json
@@ -27,11 +28,15 @@ def main(program, out):
                            frame.f_code.co_name))
         return tracer
 
-    sys.argv = [os.path.abspath(program)]
+    # Everything the harness itself runs happens before tracing starts, so that only the
+    # program's own run is recorded (the server records from the same point).
+    program = os.path.abspath(program)
+    sys.argv = [program]
+    sys.path.insert(0, os.path.dirname(program))
     main_ident = threading.get_ident()
     sys.settrace(tracer)
     try:
-        runpy.run_path(os.path.abspath(program), run_name="__main__")
+        runpy.run_path(program, run_name="__main__")
     finally:
         sys.settrace(None)
         with open(out, "w") as f:

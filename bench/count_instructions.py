@@ -1,0 +1,113 @@
+"""Instructions per trace event for each mode of run_bench.py, counted by valgrind's callgrind.
+
+Usage: python count_instructions.py [--iterations N] [--only MODE,...] [--json]
+                                    [--null-tracer-dir DIR] [--keep DIR]
+
+Wall times on a shared two-core machine move with whatever else runs there; instruction
+counts do not. For each mode this runs run_bench.py once under callgrind, with collection
+switched on only between the two clock readings around the workload (the warm-up run and one
+timed run), and divides the instructions collected by the events of those runs. The result
+is what the workload costs per event under that mode, in instructions, with no noise; it
+does not see cache misses or branch mispredictions, which the wall times do.
+
+--keep DIR leaves the callgrind output files there, one per mode, for callgrind_annotate
+(`callgrind_annotate --inclusive=yes DIR/callgrind.core-free.out`).
+With --json the results go to instructions-<python version>.json beside this script.
+"""
+
+import argparse
+import json
+import os
+import shutil
+import subprocess
+import sys
+import tempfile
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+sys.path.insert(0, HERE)
+
+import run_bench  # noqa: E402
+
+RUNS_PER_MODE = 2  # the warm-up run and one timed run
+
+
+def collected_instructions(out_file):
+    """The instruction total of a callgrind output file."""
+    with open(out_file) as f:
+        for line in f:
+            if line.startswith(("summary:", "totals:")):
+                return int(line.split()[1])
+    raise RuntimeError(f"no totals in {out_file}")
+
+
+def count_mode(mode, args, out_dir):
+    out_file = os.path.join(out_dir, f"callgrind.{mode}.out")
+    command = [
+        "valgrind", "--tool=callgrind", "--collect-atstart=no", f"--callgrind-out-file={out_file}",
+        sys.executable, os.path.join(HERE, "run_bench.py"), "--only", mode, "--repeats", "1",
+        "--iterations", str(args.iterations), "--null-tracer-dir", args.null_tracer_dir,
+        "--under-callgrind",
+    ]
+    done = subprocess.run(command, capture_output=True, text=True)
+    if done.returncode != 0:
+        tail = "\n".join(done.stderr.strip().splitlines()[-5:])
+        raise RuntimeError(f"{mode}: run under callgrind failed:\n{tail}")
+    if "skipped:" in done.stdout:
+        return None
+    return collected_instructions(out_file)
+
+
+def main(argv=None):
+    parser = argparse.ArgumentParser(description=__doc__.splitlines()[0])
+    parser.add_argument("--iterations", type=int, default=10_000)
+    parser.add_argument("--only", default="", help="comma-separated modes (default: all)")
+    parser.add_argument("--json", action="store_true")
+    parser.add_argument("--null-tracer-dir",
+                        default=os.path.join(run_bench.ROOT, "build",
+                                             f"bench-null-tracer-{run_bench.VERSION}"))
+    parser.add_argument("--keep", default="", help="folder for the callgrind output files")
+    args = parser.parse_args(argv)
+
+    if shutil.which("valgrind") is None:
+        sys.exit("valgrind is not installed (Debian package: valgrind)")
+    sys.path.insert(0, args.null_tracer_dir)
+    if not run_bench._null_tracer().HAS_CALLGRIND:
+        sys.exit("_null_tracer was built without valgrind/callgrind.h: rebuild it")
+    modes = [m for m in args.only.split(",") if m] or list(run_bench.MODES)
+    events = sum(run_bench.count_events(args.iterations).values())
+
+    out_dir = args.keep or tempfile.mkdtemp(prefix="callgrind-")
+    os.makedirs(out_dir, exist_ok=True)
+    per_event = {}
+    try:
+        for mode in modes:
+            total = count_mode(mode, args, out_dir)
+            if total is not None:
+                per_event[mode] = total / (RUNS_PER_MODE * events)
+    finally:
+        if not args.keep:
+            shutil.rmtree(out_dir, ignore_errors=True)
+
+    floor = per_event.get(run_bench.FLOOR)
+    print(f"CPython {run_bench.VERSION}, {args.iterations} iterations, {events} events per run, "
+          "instructions counted by callgrind")
+    print(f"{'mode':<16}{'instr/event':>12}{'+ over null':>13}{'x null':>8}")
+    for mode, value in per_event.items():
+        above = f"{value - floor:+.0f}" if floor else "-"
+        ratio = f"{value / floor:.2f}" if floor else "-"
+        print(f"{mode:<16}{value:>12.0f}{above:>13}{ratio:>8}")
+    if args.json:
+        path = os.path.join(HERE, f"instructions-{run_bench.VERSION}.json")
+        with open(path, "w") as f:
+            json.dump({"python": run_bench.VERSION, "iterations": args.iterations,
+                       "events_per_run": events, "instructions_per_event": per_event}, f,
+                      indent=2)
+            f.write("\n")
+        print(f"wrote {path}")
+    if args.keep:
+        print(f"callgrind output files are in {args.keep}")
+    return 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())

@@ -1,0 +1,174 @@
+"""Reference counting: the core must not leak references.
+
+On the debug interpreter the interpreter's total reference count is the judge
+(sys.gettotalrefcount()); tools/test-all runs this file there with
+SELVANE_NEED_DEBUG_INTERPRETER=1, which turns a missing debug interpreter into a failure.
+On release interpreters the same scenarios are checked through sys.getrefcount of the
+objects handed to the core.
+"""
+
+import gc
+import os
+import subprocess
+import sys
+
+import pytest
+
+import tvantrel30pydebugstackless as core
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+DEBUG = hasattr(sys, "gettotalrefcount")
+
+if not DEBUG and os.environ.get("SELVANE_NEED_DEBUG_INTERPRETER"):
+    raise RuntimeError("this run must use a debug interpreter (sys.gettotalrefcount)")
+
+needs_debug = pytest.mark.skipif(not DEBUG, reason="reference totals need a debug interpreter; "
+                                 "tools/test-all runs this file on python3.11-dbg")
+
+
+def noop(*args):
+    return None
+
+
+MODULES = {}
+ARGS = (0.0, 0, noop, noop, noop, noop, noop, noop, None, __import__, None, MODULES)
+
+
+def total():
+    gc.collect()
+    return sys.gettotalrefcount()
+
+
+def _delta(action, repeat):
+    before = total()
+    for _ in range(repeat):
+        action()
+    return total() - before
+
+
+def growth(action, repeat=50, rounds=3):
+    """References gained per call of `action`. Measuring N and 2N calls and taking the
+    difference cancels what the measurement itself costs; the smallest of a few rounds
+    counts, since a leak shows in every round while the interpreter's own occasional cache
+    fills (interned names, free lists) show in one at most."""
+    for _ in range(3):  # first uses may fill caches
+        action()
+    results = []
+    for _ in range(rounds):
+        once = _delta(action, repeat)
+        twice = _delta(action, 2 * repeat)
+        results.append((twice - once) / repeat)
+    return min(results, key=abs)
+
+
+@pytest.fixture(autouse=True)
+def initialised_core():
+    core.init(*ARGS)
+    yield
+    core.reset()
+
+
+@needs_debug
+def test_reset_and_destroy_leak_nothing():
+    assert growth(core.reset) == 0
+    assert growth(core.destroy) == 0
+    assert growth(lambda: (core.step_into(), core.reset())) == 0
+
+
+@needs_debug
+def test_repeated_init_grows_by_the_nine_overwritten_references():
+    # init overwrites, without releasing, its nine stored references: the six callbacks,
+    # import_cb, default_import and internal_modules_map. Nothing else may grow.
+    assert growth(lambda: core.init(*ARGS)) == 9
+
+
+@needs_debug
+def test_rejected_init_leaks_nothing():
+    def rejected():
+        with pytest.raises(TypeError):
+            core.init(0.0, 0, noop, noop, noop, noop, noop, noop, 3, __import__, None, {})
+
+    assert growth(rejected) == 0
+
+
+@needs_debug
+def test_utility_methods_leak_nothing():
+    def utilities():
+        core.get_tstate_tracing()
+        core.get_tstate_use_tracing()
+        core.get_current_tstate_id()
+        core.get_threads()
+        core.get_tracing()
+        core.is_botframe(sys._getframe())
+        core.get_thread_name(1)
+        core.get_thread_ident_for_tstate_id(1)
+        core.get_thread_ident_for_tstate_id(core.get_current_tstate_id())
+        core.set_autoquit(1)
+        core.set_idle_period(0.5)
+        core.set_debug_all_threads(1)
+        core.set_debug_thread_cb(noop)
+        core.set_debug_thread_cb(None)
+        core.acquire_selvane_mutex()
+        core.release_selvane_mutex()
+        core.add_to_tstate_tracing(1)
+        core.add_to_tstate_tracing(-1)
+        core.set_tstate_use_tracing(0)
+        core.set_tstate_use_tracing(1)
+        core.locals_to_fast(sys._getframe())
+        core.PyFrame_LocalsToFast(sys._getframe(), 0)
+        core.get_frame_file(sys._getframe())
+        core.is_internal_frame(sys._getframe())
+        core.step_into()
+        core.get_curr_frame(core.get_current_tstate_id())
+        core.step_over()
+        core.step_over_line()
+        core.step_over_line_range(1, 2)
+        core.step_out()
+        core.stop()
+        core.continue_run()
+        core.raise_exception(0, ValueError("x"))
+        core.raise_exception(0, None)
+        with pytest.raises(IndexError):
+            core.get_curr_frame(12345)
+        with pytest.raises(TypeError):
+            core.set_autoquit("x")
+
+    assert growth(utilities) == 0
+
+
+@needs_debug
+def test_tracing_cycles_leave_the_total_flat():
+    # Each cycle: start_trace, a stepping scenario with generators, an exception and a
+    # thread, stop_trace, reset. The first cycle fills the interpreter's and the core's
+    # caches; from then on every cycle must leave the total where it was.
+    out = subprocess.run([sys.executable, os.path.join(HERE, "refcount_cycle.py"), "8"],
+                         capture_output=True, text=True, timeout=300, check=True).stdout
+    lines = out.split()
+    assert lines[-2:] == ["threads", "0"]  # no thread record survives reset
+    totals = [int(x) for x in lines[:-2]]
+    assert len(totals) == 8
+    assert totals[2:] == [totals[1]] * 6, totals
+
+
+def test_callbacks_are_held_once_and_given_back_by_the_next_init():
+    def line_cb(frame, changed):
+        return None
+
+    before = sys.getrefcount(line_cb)
+    core.init(0.0, 0, noop, noop, line_cb, noop, noop, noop, None, __import__, None, {})
+    assert sys.getrefcount(line_cb) == before + 1
+    core.reset()  # reset keeps the callbacks
+    assert sys.getrefcount(line_cb) == before + 1
+
+
+def test_pending_exception_reference_is_released_when_cleared():
+    exc = ValueError("pending")
+    before = sys.getrefcount(exc)
+    core.raise_exception(0, exc)
+    assert sys.getrefcount(exc) == before + 1
+    core.raise_exception(0, None)
+    assert sys.getrefcount(exc) == before
+    core.raise_exception(0, exc)
+    core.reset()  # the thread record goes, and with it the pending exception
+    assert sys.getrefcount(exc) == before
+
