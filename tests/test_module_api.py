@@ -447,3 +447,62 @@ def test_docstrings():
                                            "locals dict")
     for name in ("trace_dispatch", "bootstrap_new_thread", "thread_exiting"):
         assert getattr(core, name).__doc__ is None
+
+
+# ---- the trace function and the stepping methods as Python callables ------------------------
+
+
+def test_trace_dispatch_event_names():
+    log = Collector()
+    core.init(*init_args(dprintf_file=log))
+    frame = sys._getframe()
+    for name in ("", "xyz", "?"):
+        assert core.trace_dispatch(frame, name, None) is core.trace_dispatch
+    assert "trace_dispatch called while not tracing" not in log.getvalue()
+    # Only the first character counts: a C-call event name is a call event.
+    assert core.trace_dispatch(frame, "c_call", None) is core.trace_dispatch
+    assert log.getvalue().count("trace_dispatch called while not tracing") == 1
+    assert core.trace_dispatch(frame, "line", None) is core.trace_dispatch
+    assert log.getvalue().count("trace_dispatch called while not tracing") == 2
+
+
+def test_trace_dispatch_and_hooks_reject_bad_arguments():
+    for call in (lambda: core.trace_dispatch(), lambda: core.trace_dispatch(1, "line", None),
+                 lambda: core.trace_dispatch(sys._getframe(), "line"),
+                 lambda: core.bootstrap_new_thread(1, 2)):
+        with pytest.raises(TypeError):
+            call()
+    assert_core_still_works()
+
+
+def test_stepping_methods_reject_bad_arguments_and_change_nothing():
+    core.step_into()
+    with pytest.raises(TypeError):
+        core.step_over_line_range("a", 2)
+    with pytest.raises(TypeError):
+        core.step_over_line_range(1)
+    with pytest.raises(TypeError):
+        core.stop_trace(1)
+    with pytest.raises(TypeError):
+        core.is_internal_frame("frame")
+    assert core.get_threads() == [core.get_current_tstate_id()]
+    assert_core_still_works()
+
+
+def test_is_internal_frame_uses_the_internal_modules_map():
+    core.init(*init_args(internal_modules_map={__file__: 1}))
+    assert core.is_internal_frame(sys._getframe()) == 1
+    core.init(*init_args(internal_modules_map={}))
+    assert core.is_internal_frame(sys._getframe()) == 0
+
+
+def test_start_trace_before_init_is_an_error_not_a_crash():
+    import subprocess
+    code = ("import tvantrel30pydebugstackless as c\n"
+            "try:\n    c.start_trace()\nexcept RuntimeError as e:\n    print('refused:', e)\n"
+            "print(c.get_threads(), c.get_tracing())\nc.reset()\nc.step_into()\n"
+            "print(c.get_tracing())\n")
+    out = subprocess.run([sys.executable, "-c", code], capture_output=True, text=True,
+                         timeout=60)
+    assert out.returncode == 0, out.stderr
+    assert out.stdout == "refused: init must be called before start_trace\n[] 0\n1\n"

@@ -506,6 +506,23 @@ def test_step_over_line_steps_over_a_comprehension_on_every_version(tmp_path):
     assert_stops(run.stops, [line(1), line(4), line(5), line(6), line(7)])
 
 
+def test_step_out_of_a_function_called_by_a_comprehension(tmp_path):
+    if INLINED_COMPREHENSIONS:
+        # sq's caller is the module frame itself. A step_out there leaves the module frame:
+        # the second call of sq and the module's remaining lines are its callee's and its
+        # own events, and only its return stops.
+        commands = ["step_into", "step_into", "step_out", "step_out", "step_out"]
+        expected = [line(1), line(4), line(2, "sq"), ret(2, "sq", 0), line(4),
+                    ret(7, "<module>", None)]
+    else:
+        # sq's caller is the <listcomp> frame; stepping out of that lands in the module.
+        commands = ["step_into", "step_into", "step_into"] + ["step_out"] * 4
+        expected = [line(1), line(4), line(4, "<listcomp>"), line(2, "sq"), ret(2, "sq", 0),
+                    line(4, "<listcomp>"), ret(4, "<listcomp>", "list"), line(5)]
+    run = trace(tmp_path, COMPREHENSIONS, commands=commands)
+    assert_stops(run.stops, expected)
+
+
 DECORATORS = """
 def logged(fn):
     def wrapper(*args):
@@ -709,6 +726,16 @@ def test_step_out_of_frames_left_by_an_exception(tmp_path):
     ])
 
 
+def test_step_over_line_does_not_stop_at_an_exception_arriving_on_that_line(tmp_path):
+    # As with its line events, the stop frame's exception event on line 10 is inside the
+    # range; the `except` line is not.
+    run = trace(tmp_path, EXCEPTIONS, commands=steps("step_into", 5, "step_over_line", 3))
+    assert_stops(run.stops, [
+        line(1), line(4), line(8), line(16), line(9, "top"),
+        line(10, "top"), line(11, "top"), line(12, "top"), line(14, "top"),
+    ])
+
+
 def test_continue_run_does_not_stop_at_exceptions(tmp_path):
     run = trace(tmp_path, EXCEPTIONS, commands=["continue_run"], default="step_into")
     assert_stops(run.stops, [line(1)])
@@ -731,6 +758,28 @@ def test_step_into_an_exception_that_ends_the_program(tmp_path):
         line(1), line(4), line(5), line(2, "boom"),
         exc(2, "boom", "KeyError"), ret(2, "boom", None),
         exc(5, "<module>", "KeyError"), ret(5, "<module>", None),
+    ])
+
+
+def test_step_into_sys_exit_keeps_the_exit_status(tmp_path):
+    source = """
+    import sys
+
+    def finish(code):
+        print("finishing")
+        sys.exit(code)
+
+    finish(3)
+    print("not reached")
+    """
+    run = trace(tmp_path, source, default="step_into")
+    assert run.returncode == 3
+    assert run.stdout == "finishing\n"
+    assert_stops(run.stops, [
+        line(1), line(3), line(7),
+        line(4, "finish"), line(5, "finish"),
+        exc(5, "finish", "SystemExit"), ret(5, "finish", None),
+        exc(7, "<module>", "SystemExit"), ret(7, "<module>", None),
     ])
 
 
@@ -776,7 +825,7 @@ def test_step_over_an_import_statement(tmp_path):
 
 def test_step_out_in_the_bottom_frame_stops_at_the_next_event(tmp_path):
     # A raw thread runs worker with no Python caller: worker is the bottom frame of its
-    # thread. It turns on the thread hook the server side installed (as a raw thread must),
+    # thread (line 17 prints that it has no caller). It turns on the thread hook the server side installed (as a raw thread must),
     # and the call of hop starts tracing it. Its thread record starts running freely, so the
     # first stop is the KeyError (exception_mode 1); step_out there has no caller to go to,
     # so the next event anywhere stops: the `except` line.
@@ -796,7 +845,8 @@ def test_step_out_in_the_bottom_frame_stops_at_the_next_event(tmp_path):
         try:
             raise KeyError("w")
         except KeyError:
-            print("bottom", sys._getframe().f_back is None)
+            hop()
+        print("bottom", sys._getframe().f_back is None)
         done.set()
 
     _thread.start_new_thread(worker, ())
@@ -804,6 +854,11 @@ def test_step_out_in_the_bottom_frame_stops_at_the_next_event(tmp_path):
     print("end")
     """
     run = trace(tmp_path, source, exception_mode=1, when_elsewhere="continue_run",
-                commands=["step_out", "continue_run"])
+                commands=["step_out", "step_over", "step_over", "continue_run"])
     assert run.stdout == "bottom True\nend\n"
-    assert_stops(run.stops, [exc(14, "worker", "KeyError"), line(15, "worker")])
+    assert_stops(run.stops, [
+        exc(14, "worker", "KeyError"),
+        line(15, "worker"),     # step_over: worker is both the stop frame and the bottom
+        line(16, "worker"),     # frame; hop, its callee, must not stop
+        line(17, "worker"),     # continue_run: the thread runs on freely
+    ])

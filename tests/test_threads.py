@@ -178,3 +178,50 @@ def test_traced_thread_program_output_matches_an_untraced_run(tmp_path):
     traced = run_traced(tmp_path, SEQUENTIAL, **THREADED)
     plain = run_plain(tmp_path, SEQUENTIAL)
     assert (traced.returncode, traced.stdout) == (plain.returncode, plain.stdout)
+
+
+RAW_THREAD_PRELUDE = """
+import _thread
+import sys
+sys.path.insert(0, shared.program_dir)
+import mythreading
+
+shared.lock = _thread.allocate_lock()
+shared.lock.acquire()
+
+def target():
+    shared.ready.set()
+    shared.lock.acquire()          # waits in C: target stays the innermost Python frame
+    try:
+        raise ValueError("raw")
+    except ValueError:
+        pass
+    shared.done.set()
+
+shared.done = threading.Event()
+shared.ready = threading.Event()
+_thread.start_new_thread(mythreading._bootstrap_inner, (target,))
+shared.ready.wait(30)              # from here on the thread stands in target()
+"""
+
+RAW_THREAD = """
+    import _scripted_shared as shared
+
+    shared.lock.release()
+    shared.done.wait(30)
+    print("raw thread done")
+"""
+
+
+def test_bootstrap_frame_in_any_file_ending_in_threading_py(tmp_path):
+    # The thread runs target() from _bootstrap_inner of mythreading.py: any file whose name
+    # ends in "threading.py" counts as the threading bootstrap, so the thread is named after
+    # the function the bootstrap called.
+    (tmp_path / "mythreading.py").write_text("def _bootstrap_inner(target):\n    target()\n")
+    prelude = f"shared.program_dir = {str(tmp_path)!r}\n" + RAW_THREAD_PRELUDE
+    run = ok(run_traced(tmp_path, RAW_THREAD, prelude=prelude, files=["<string>"],
+                        probe="core.get_thread_name(core.get_current_tstate_id())",
+                        **THREADED))
+    assert_stops(run.stops, [("exception", "<string>", 15, "target", "ValueError", "?",
+                              "target")])
+    assert run.stdout == "raw thread done\n"

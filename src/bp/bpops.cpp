@@ -1,7 +1,9 @@
 // bpops.cpp: breakpoint tables (see bpops.h).
 #include "bp/bpops.h"
 
-void __tracer_init_bp_ops_data(BpOpsData* data, COPathnameTable*) { data->unique_import_count = 0; }
+void __tracer_init_bp_ops_data(BpOpsData* data, COPathnameTable*) {
+  data->unique_import_count = 0;
+}
 
 void __tracer_clear_bp_ops_data(BpOpsData* data, COPathnameTable*) {
   data->unique_import_count = 0;

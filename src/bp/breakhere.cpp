@@ -2,4 +2,6 @@
 // breakpoint tables land, so nothing is ever hit yet.
 #include "bp/breakhere.h"
 
-int __tracer_break_here(BpOpsData*, int, ThreadData*, PyObject*, int) { return 0; }
+int __tracer_break_here(BpOpsData*, int, ThreadData*, PyObject*, int) {
+  return 0;
+}

@@ -51,7 +51,9 @@ void check_fork() {
 
 // Debug output is diagnostics: while it is on, every event takes the mutex up front, in
 // the order the messages describe.
-bool debug_output_on() { return dprintf_wanted(kDbgFlow | kDbgExceptions | kDbgPathnames); }
+bool debug_output_on() {
+  return dprintf_wanted(kDbgFlow | kDbgExceptions | kDbgPathnames);
+}
 
 void leave_debugger(EventState& event) {
   if (!event.entered) return;
@@ -141,7 +143,9 @@ int run_event(PyFrameObject* frame, int what, PyObject* arg) {
 
 }  // namespace
 
-void note_fork_in_child() { gForkSeen = 1; }
+void note_fork_in_child() {
+  gForkSeen = 1;
+}
 
 void enter_debugger() {
   EventState* event = tEvent;
@@ -199,11 +203,20 @@ PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args) {
   const char* name = _pystring_to_c_string(event);
   int what = -1;
   switch (name != nullptr ? name[0] : '\0') {
-    case 'c': what = PyTrace_CALL; break;
-    case 'e': what = PyTrace_EXCEPTION; break;
-    case 'l': what = PyTrace_LINE; break;
-    case 'r': what = PyTrace_RETURN; break;
-    default: break;
+    case 'c':
+      what = PyTrace_CALL;
+      break;
+    case 'e':
+      what = PyTrace_EXCEPTION;
+      break;
+    case 'l':
+      what = PyTrace_LINE;
+      break;
+    case 'r':
+      what = PyTrace_RETURN;
+      break;
+    default:
+      break;
   }
   int result = what < 0 ? 0 : c_dispatch(self, reinterpret_cast<PyFrameObject*>(frame), what, arg);
   if (result != 0) {
@@ -315,8 +328,8 @@ int dispatch_line(PyObject* frame) {
   }
   int result = 0;
   if (__tracer_stop_here(frame, 1) ||
-      __tracer_break_here(&gSelf.bp_ops_data, 1,
-                          current_thread_data_or_insert(&gSelf.thread_table), frame, 1)) {
+      __tracer_break_here(&gSelf.bp_ops_data, 1, current_thread_data_or_insert(&gSelf.thread_table),
+                          frame, 1)) {
     if (do_callback(gSelf.line_cb.get(), frame, nullptr) != 0) result = -1;
   }
   if (result == 0) {
@@ -370,9 +383,8 @@ int dispatch_return(PyObject* frame, PyObject* retval) {
   }
   bool stop = data->step_out_frame.is(frame) || __tracer_stop_here(frame, 2);
   if (stop) {
-    return do_callback(gSelf.return_cb.get(), frame, retval != nullptr ? retval : Py_None) != 0
-               ? -1
-               : 0;
+    return do_callback(gSelf.return_cb.get(), frame, retval != nullptr ? retval : Py_None) != 0 ? -1
+                                                                                                : 0;
   }
   if (data->bot_frame.is(frame)) {
     unsigned long identity = get_thread_ident();

@@ -34,8 +34,8 @@ void set_f_trace(PyObject* frame, PyObject* value) {
 }
 
 Ref code_name(PyObject* frame) {
-  Ref code = Ref::steal(reinterpret_cast<PyObject*>(
-      PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(frame))));
+  Ref code = Ref::steal(
+      reinterpret_cast<PyObject*>(PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(frame))));
   return Ref::borrow(reinterpret_cast<PyCodeObject*>(code.get())->co_name);
 }
 
@@ -231,7 +231,7 @@ int __is_threading_bootstrap(PyObject* frame) {
   if (strcmp(text, "_bootstrap_inner") != 0 && strcmp(text, "_bootstrap") != 0) return 0;
   static char buffer[kMaxPathLen + 1];
   return full_path_pruned(frame, buffer, sizeof buffer) && ends_with(buffer, "threading.py") ? 1
-                                                                                              : 0;
+                                                                                             : 0;
 }
 
 int is_internal_frame(PyObject* frame) {

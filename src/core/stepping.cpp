@@ -85,15 +85,17 @@ int __tracer_stop_here(PyObject* frame, int event) {
   return 0;
 }
 
-void __tracer_step_into(ThreadData* data) { set_stepping(data, Ref::none(), Ref::none(), -1, -1); }
+void __tracer_step_into(ThreadData* data) {
+  set_stepping(data, Ref::none(), Ref::none(), -1, -1);
+}
 
 void __tracer_step_over(ThreadData* data) {
   set_stepping(data, data->curr_frame, Ref::none(), -1, -1);
 }
 
 void __tracer_step_over_line(ThreadData* data) {
-  int line = compat::is_plain_frame(data->curr_frame.get()) ? frame_line(data->curr_frame.get())
-                                                            : -1;
+  int line =
+      compat::is_plain_frame(data->curr_frame.get()) ? frame_line(data->curr_frame.get()) : -1;
   set_stepping(data, data->curr_frame, Ref::none(), line, line);
 }
 
@@ -108,7 +110,9 @@ int __tracer_step_out(ThreadData* data) {
   return 1;
 }
 
-void __tracer_continue_run(ThreadData* data) { set_stepping(data, Ref(), Ref::none(), -1, -1); }
+void __tracer_continue_run(ThreadData* data) {
+  set_stepping(data, Ref(), Ref::none(), -1, -1);
+}
 
 void __tracer_stop(ThreadData* data) {
   // A pending step-out still stops at its frame's return.

@@ -6,11 +6,11 @@
 #include "support/ref.h"
 
 struct SubLanguageState {
-  int active = 0;      // 1 once any hook is registered
-  Ref hooks;           // owned list of registered hook objects, or null
-  Ref module_paths;    // owned dict, or null
-  Ref marker_frames;   // owned dict, or null
-  Ref frame_categories;  // owned dict, or null
+  int active = 0;           // 1 once any hook is registered
+  Ref hooks;                // owned list of registered hook objects, or null
+  Ref module_paths;         // owned dict, or null
+  Ref marker_frames;        // owned dict, or null
+  Ref frame_categories;     // owned dict, or null
   CU_HashTable code_table;  // one-word keys
 };
 

@@ -26,11 +26,23 @@ void store_callbacks(TracerState& s, PyObject* install_thread_hooks_cb, PyObject
   // A repeated init overwrites these without releasing the earlier references: a server
   // side that re-initialises from inside one of its callbacks must not see that callback's
   // objects disappear under it. The cost is a fixed number of references per init.
-  Ref* fields[] = {&s.install_thread_hooks_cb, &s.idle_cb,     &s.line_cb,
-                   &s.return_cb,               &s.exception_cb, &s.quit_cb,
-                   &s.import_cb,               &s.default_import, &s.internal_modules_map};
-  PyObject* values[] = {install_thread_hooks_cb, idle_cb,  line_cb,        return_cb,
-                        exception_cb,            quit_cb,  import_cb,      default_import,
+  Ref* fields[] = {&s.install_thread_hooks_cb,
+                   &s.idle_cb,
+                   &s.line_cb,
+                   &s.return_cb,
+                   &s.exception_cb,
+                   &s.quit_cb,
+                   &s.import_cb,
+                   &s.default_import,
+                   &s.internal_modules_map};
+  PyObject* values[] = {install_thread_hooks_cb,
+                        idle_cb,
+                        line_cb,
+                        return_cb,
+                        exception_cb,
+                        quit_cb,
+                        import_cb,
+                        default_import,
                         internal_modules_map};
   for (size_t i = 0; i < sizeof fields / sizeof fields[0]; ++i) {
     fields[i]->forget();
@@ -83,6 +95,7 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
 
   if (s.thread_table.buckets != nullptr) clear_thread_table(&s.thread_table);
   init_thread_table(&s.thread_table);
+  s.pending_exception_count = 0;  // the records that held them are gone
   s.thread_mutex = allocate_thread_mutex();
   s.selvane_mutex_owner = kNoMutexOwner;
 
@@ -124,6 +137,9 @@ void __tracer_reset() {
   __tracer_stop_trace();
   do_dprintf(kDbgFlow, "RESET THREAD TABLE\n");
   clear_thread_table(&s.thread_table);
+  // Injected exceptions went with their records; a stale count would make every later event
+  // look for one.
+  s.pending_exception_count = 0;
   __tracer_clear_exception_filters(&s.exc_filters);
   __tracer_clear_bp_ops_data(&s.bp_ops_data, &s.co_pathname_table);
   Ref new_imports = Ref::steal(PyList_New(0));

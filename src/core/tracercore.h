@@ -36,12 +36,12 @@ struct TracerState {
   int exception_mode = kExcNeverStop;
   int autoquit = 0;
   int debug_all_threads = 0;
-  Ref debug_thread_cb;                  // owned or null
-  CU_HashTable debug_thread_map;        // thread identity -> cached decision (0 or 1)
-  CU_HashTable thread_table;            // thread state -> ThreadData
+  Ref debug_thread_cb;            // owned or null
+  CU_HashTable debug_thread_map;  // thread identity -> cached decision (0 or 1)
+  CU_HashTable thread_table;      // thread state -> ThreadData
   PyThread_type_lock thread_mutex = nullptr;
   unsigned long selvane_mutex_owner = kNoMutexOwner;
-  Ref install_thread_hooks_cb;          // owned (all callbacks below too)
+  Ref install_thread_hooks_cb;  // owned (all callbacks below too)
   Ref idle_cb;
   Ref line_cb;
   Ref return_cb;
@@ -57,7 +57,7 @@ struct TracerState {
   int idle_tick_limit = 10;
   time_t next_idle_time = 0;
   ExcFilters exc_filters;
-  Ref spare_ref;                      // owned or null; only destroy releases it
+  Ref spare_ref;                         // owned or null; only destroy releases it
   FileOpsData* file_ops_data = nullptr;  // owned, made at module load
   BpOpsData bp_ops_data;
   Ref new_imports;            // owned list of full path names

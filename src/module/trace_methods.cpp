@@ -46,22 +46,29 @@ PyObject* _tracer_start_trace(PyObject*, PyObject*) {
 PyObject* _tracer_stop_trace(PyObject*, PyObject* args) {
   do_dprintf(kDbgFlow, "STOP TRACE AFTER %i INSTRUCTIONS\n",
              static_cast<int>(gSelf.instruction_count));
-  do_dprintf(kDbgFlow, "%i IMPORT HOOK CALLS WERE MADE\n", static_cast<int>(gSelf.import_hook_calls));
+  do_dprintf(kDbgFlow, "%i IMPORT HOOK CALLS WERE MADE\n",
+             static_cast<int>(gSelf.import_hook_calls));
   do_dprintf(kDbgFlow, "%i UNIQUE IMPORTS WERE MADE\n", gSelf.bp_ops_data.unique_import_count);
   if (!PyArg_ParseTuple(args, ":tracer_stop_trace")) return nullptr;
   __tracer_stop_trace();
   Py_RETURN_NONE;
 }
 
-PyObject* _tracer_step_into(PyObject*, PyObject*) { return run_step_command(__tracer_step_into); }
-PyObject* _tracer_step_over(PyObject*, PyObject*) { return run_step_command(__tracer_step_over); }
+PyObject* _tracer_step_into(PyObject*, PyObject*) {
+  return run_step_command(__tracer_step_into);
+}
+PyObject* _tracer_step_over(PyObject*, PyObject*) {
+  return run_step_command(__tracer_step_over);
+}
 PyObject* _tracer_step_over_line(PyObject*, PyObject*) {
   return run_step_command(__tracer_step_over_line);
 }
 PyObject* _tracer_continue_run(PyObject*, PyObject*) {
   return run_step_command(__tracer_continue_run);
 }
-PyObject* _tracer_stop(PyObject*, PyObject*) { return run_step_command(__tracer_stop); }
+PyObject* _tracer_stop(PyObject*, PyObject*) {
+  return run_step_command(__tracer_stop);
+}
 
 PyObject* _tracer_step_over_line_range(PyObject*, PyObject* args) {
   ThreadData* data = calling_thread_record();

@@ -17,12 +17,14 @@
 namespace {
 PyObject* gModuleSelf = nullptr;  // owned for the life of the process
 
-bool check_init_arguments(PyObject* const* callbacks, PyObject* import_cb,
-                          PyObject* default_import, PyObject* internal_modules_map) {
-  static const char* const kCallbackErrors[] = {
-      "install_thread_hooks_cb must be callable", "idle_cb must be callable",
-      "line_cb must be callable",                 "return_cb must be callable",
-      "exception_cb must be callable",            "quit_cb must be callable"};
+bool check_init_arguments(PyObject* const* callbacks, PyObject* import_cb, PyObject* default_import,
+                          PyObject* internal_modules_map) {
+  static const char* const kCallbackErrors[] = {"install_thread_hooks_cb must be callable",
+                                                "idle_cb must be callable",
+                                                "line_cb must be callable",
+                                                "return_cb must be callable",
+                                                "exception_cb must be callable",
+                                                "quit_cb must be callable"};
   for (int i = 0; i < 6; ++i) {
     if (!PyCallable_Check(callbacks[i])) {
       PyErr_SetString(PyExc_TypeError, kCallbackErrors[i]);
@@ -82,7 +84,8 @@ PyObject* _tracer_destroy(PyObject*, PyObject*) {
 
 namespace {
 
-#define METHOD(name, fn, doc) {name, reinterpret_cast<PyCFunction>(fn), METH_VARARGS, PyDoc_STR(doc)}
+#define METHOD(name, fn, doc) \
+  { name, reinterpret_cast<PyCFunction>(fn), METH_VARARGS, PyDoc_STR(doc) }
 
 PyMethodDef gMethods[] = {
     METHOD("init", _tracer_init, "initialise the core; must come first"),
@@ -135,7 +138,8 @@ PyMethodDef gMethods[] = {
     METHOD("locals_to_fast", locals_to_fast,
            "Call LocalsToFast on given frame so changes made in the frame locals dict get\nput "
            "back into the real locals dict"),
-    METHOD("get_frame_file", get_frame_file, "Returns the filename associated with the given frame"),
+    METHOD("get_frame_file", get_frame_file,
+           "Returns the filename associated with the given frame"),
     METHOD("get_current_tstate_id", get_current_tstate_id, "Returns id of current thread state"),
     METHOD("get_thread_ident_for_tstate_id", get_thread_ident_for_tstate_id,
            "Returns id returned by thread.get_ident for given tstate_id"),
@@ -155,8 +159,15 @@ PyMethodDef gMethods[] = {
 #undef METHOD
 
 PyModuleDef gModuleDef = {
-    PyModuleDef_HEAD_INIT, "tvantrel30pydebugstackless", nullptr, -1, gMethods,
-    nullptr,               nullptr,                      nullptr, nullptr,
+    PyModuleDef_HEAD_INIT,
+    "tvantrel30pydebugstackless",
+    nullptr,
+    -1,
+    gMethods,
+    nullptr,
+    nullptr,
+    nullptr,
+    nullptr,
 };
 
 // The string makers are looked up by name because their symbol names once depended on the

@@ -87,8 +87,7 @@ char* _pystring_to_c_string_copy(PyObject* str) {
   if (text == nullptr) return nullptr;
   char* copy = strdup(text);
   if (copy == nullptr) {
-    do_dprintf(kDbgPathnames, "FAILURE: Out of memory copying string: %s",
-               dprint_check_pystr(str));
+    do_dprintf(kDbgPathnames, "FAILURE: Out of memory copying string: %s", dprint_check_pystr(str));
     PyErr_Clear();
   }
   return copy;

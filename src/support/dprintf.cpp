@@ -43,7 +43,8 @@ Ref format_message(const char* format, va_list args) {
   Ref message = Ref::steal(gPtrTo_PyUnicode_FormatV(format, args));
   if (!message) {
     PyErr_Clear();
-    message = Ref::steal(gPtrTo_PyUnicode_FromString("DPRINTF error: unable to create output string\n"));
+    message =
+        Ref::steal(gPtrTo_PyUnicode_FromString("DPRINTF error: unable to create output string\n"));
   }
   return message;
 }

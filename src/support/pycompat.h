@@ -32,11 +32,17 @@ inline PyThreadState* current_tstate() noexcept {
 }
 
 // The thread's identity as threading.get_ident() reports it (private field).
-inline unsigned long tstate_thread_id(PyThreadState* ts) noexcept { return ts->thread_id; }
+inline unsigned long tstate_thread_id(PyThreadState* ts) noexcept {
+  return ts->thread_id;
+}
 
 // The trace object installed with PyEval_SetTrace in `ts` (private field). Borrowed.
-inline PyObject* tstate_traceobj(PyThreadState* ts) noexcept { return ts->c_traceobj; }
-inline Py_tracefunc tstate_tracefunc(PyThreadState* ts) noexcept { return ts->c_tracefunc; }
+inline PyObject* tstate_traceobj(PyThreadState* ts) noexcept {
+  return ts->c_traceobj;
+}
+inline Py_tracefunc tstate_tracefunc(PyThreadState* ts) noexcept {
+  return ts->c_tracefunc;
+}
 inline bool tstate_has_trace_or_profile(PyThreadState* ts) noexcept {
   return ts->c_tracefunc != nullptr || ts->c_profilefunc != nullptr;
 }
@@ -90,7 +96,9 @@ inline thread_local bool use_tracing_off = false;
 inline int tracing_get(PyThreadState* ts) noexcept {
   return ts->tracing - (detail::use_tracing_off ? 1 : 0);
 }
-inline void tracing_add(PyThreadState* ts, int delta) noexcept { ts->tracing += delta; }
+inline void tracing_add(PyThreadState* ts, int delta) noexcept {
+  ts->tracing += delta;
+}
 
 // 1 when trace and profile functions would be called in this thread now, else 0.
 inline int use_tracing_get(PyThreadState* ts) noexcept {
@@ -133,7 +141,9 @@ class PendingError {
 #endif
     exc_ = nullptr;
   }
-  bool empty() const noexcept { return exc_ == nullptr && type_ == nullptr; }
+  bool empty() const noexcept {
+    return exc_ == nullptr && type_ == nullptr;
+  }
 
   // Writes the held exception and its traceback to sys.stderr and keeps holding it. Unlike
   // PyErr_Print this never exits the process on SystemExit and leaves sys.last_* alone:
@@ -156,7 +166,9 @@ class PendingError {
 
 // ---- Frames ------------------------------------------------------------------------------
 
-inline bool is_plain_frame(PyObject* obj) noexcept { return Py_IS_TYPE(obj, &PyFrame_Type); }
+inline bool is_plain_frame(PyObject* obj) noexcept {
+  return Py_IS_TYPE(obj, &PyFrame_Type);
+}
 
 // The caller of `frame`, or a null Ref at the bottom. New reference.
 inline Ref frame_back(PyFrameObject* frame) noexcept {

@@ -37,7 +37,9 @@ unsigned long get_thread_ident() {
   return gGetThreadIdentFunc != nullptr ? gGetThreadIdentFunc() : 1;
 }
 
-PyThread_type_lock allocate_thread_mutex() { return PyThread_allocate_lock(); }
+PyThread_type_lock allocate_thread_mutex() {
+  return PyThread_allocate_lock();
+}
 
 int acquire_thread_mutex(PyThread_type_lock lock, int wait) {
   if (lock == nullptr) return 1;
@@ -86,7 +88,9 @@ void free_thread_data(ThreadData* data) {
   delete data;
 }
 
-void init_thread_table(CU_HashTable* table) { CU_InitHashTable(table, sizeof(PyThreadState*)); }
+void init_thread_table(CU_HashTable* table) {
+  CU_InitHashTable(table, sizeof(PyThreadState*));
+}
 
 ThreadData* find_thread_data(CU_HashTable* table, PyThreadState* tstate) {
   CU_HashEntry* entry = CU_FindHashEntry(table, &tstate);
@@ -145,7 +149,9 @@ ThreadData* get_current_thread_data(CU_HashTable* table) {
   return data;
 }
 
-PyObject* id_for_tstate_ptr(PyThreadState* tstate) { return PyLong_FromVoidPtr(tstate); }
+PyObject* id_for_tstate_ptr(PyThreadState* tstate) {
+  return PyLong_FromVoidPtr(tstate);
+}
 
 PyThreadState* tstate_ptr_for_id(PyObject* id) {
   return static_cast<PyThreadState*>(PyLong_AsVoidPtr(id));

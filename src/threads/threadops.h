@@ -16,15 +16,15 @@
 #include "support/ref.h"
 
 struct ThreadData {
-  int32_t tracer_in_frames = 0;  // 1 once the tracer was put into the thread's frames
-  int32_t global_trace_set = 0;  // 1 while the thread's C trace function is ours
-  PyThreadState* tstate;         // the key; borrowed, never dereferenced after the thread ends
-  unsigned long thread_id;       // the thread's identity, refreshed on every lookup
-  Ref thread_name;               // owned: name of the thread's main function, or None
-  Ref bot_frame;                 // owned: bottom frame of the debugged code, or None
-  Ref stop_frame;                // owned: null runs freely, None stops anywhere, a frame
-  Ref step_out_frame;            // owned: frame a step-out leaves, or None
-  Ref curr_frame;                // owned: frame of the latest event, None outside the core
+  int32_t tracer_in_frames = 0;   // 1 once the tracer was put into the thread's frames
+  int32_t global_trace_set = 0;   // 1 while the thread's C trace function is ours
+  PyThreadState* tstate;          // the key; borrowed, never dereferenced after the thread ends
+  unsigned long thread_id;        // the thread's identity, refreshed on every lookup
+  Ref thread_name;                // owned: name of the thread's main function, or None
+  Ref bot_frame;                  // owned: bottom frame of the debugged code, or None
+  Ref stop_frame;                 // owned: null runs freely, None stops anywhere, a frame
+  Ref step_out_frame;             // owned: frame a step-out leaves, or None
+  Ref curr_frame;                 // owned: frame of the latest event, None outside the core
   int32_t line_range_start = -1;  // first line of a stepped-over range, -1 for none
   int32_t line_range_end = -1;    // last line of that range, -1 for none
   Ref sub_language_frame;         // owned or null: frame where the sub-language was entered

@@ -1,0 +1,141 @@
+// test_pycompat.cpp: the version accessors the core relies on to keep the interpreter from
+// tracing its own work: the tracing counter, the use-tracing switch built on it, and that
+// the interpreter really sends no events while they say so.
+#include "support/pycompat.h"
+
+#include <gtest/gtest.h>
+
+#include "core_test_support.h"
+
+namespace {
+
+constexpr const char* kProgram = R"(
+import sys
+events = []
+def python_tracer(frame, event, arg):
+    events.append(event)
+    return python_tracer
+def work():
+    total = 0
+    for i in range(3):
+        total += i
+    return total
+)";
+
+class CompatTest : public coretest::PythonTest {
+ protected:
+  void SetUp() override {
+    PythonTest::SetUp();
+    program_ = coretest::make_namespace(kProgram);
+    ts_ = PyThreadState_Get();
+  }
+  void TearDown() override {
+    EXPECT_EQ(compat::tracing_get(ts_), 0);
+    EXPECT_EQ(ts_->tracing, 0);
+    PythonTest::TearDown();
+  }
+  void run_work() {
+    Ref result = Ref::steal(PyObject_CallNoArgs(coretest::item(program_.get(), "work")));
+    ASSERT_TRUE(result);
+  }
+  // sys.settrace(tracer) called from C, as a server side would.
+  void sys_settrace(PyObject* tracer) {
+    Ref sys = Ref::steal(PyImport_ImportModule("sys"));
+    Ref result = Ref::steal(PyObject_CallMethod(sys.get(), "settrace", "O", tracer));
+    ASSERT_TRUE(result);
+  }
+  Py_ssize_t python_events() { return PyList_Size(coretest::item(program_.get(), "events")); }
+
+  Ref program_;
+  PyThreadState* ts_ = nullptr;
+};
+
+TEST_F(CompatTest, TracingCounterReadsAndAddsTheInterpretersField) {
+  EXPECT_EQ(compat::tracing_get(ts_), ts_->tracing);
+  compat::tracing_add(ts_, 3);
+  EXPECT_EQ(compat::tracing_get(ts_), 3);
+  EXPECT_EQ(ts_->tracing, 3);
+  compat::tracing_add(ts_, -3);
+  EXPECT_EQ(compat::tracing_get(ts_), 0);
+}
+
+TEST_F(CompatTest, UseTracingSwitchIsIndependentOfTheCounterCallersSee) {
+  compat::use_tracing_set(ts_, 0);
+  compat::use_tracing_set(ts_, 0);  // a second "off" holds no second unit
+  EXPECT_EQ(compat::use_tracing_get(ts_), 0);
+  EXPECT_EQ(compat::tracing_get(ts_), 0);
+  compat::tracing_add(ts_, 1);
+  EXPECT_EQ(compat::tracing_get(ts_), 1);
+  compat::tracing_add(ts_, -1);
+  compat::use_tracing_set(ts_, 5);
+  compat::use_tracing_set(ts_, 1);
+  EXPECT_EQ(compat::tracing_get(ts_), 0);
+  EXPECT_EQ(ts_->tracing, 0);
+}
+
+TEST_F(CompatTest, UseTracingGetSaysWhetherHooksWouldBeCalled) {
+  EXPECT_EQ(compat::use_tracing_get(ts_), 0);  // no trace or profile function
+  {
+    coretest::TraceCounter counter;
+    EXPECT_EQ(compat::use_tracing_get(ts_), 1);
+    compat::tracing_add(ts_, 1);
+    EXPECT_EQ(compat::use_tracing_get(ts_), 0);
+    compat::tracing_add(ts_, -1);
+    compat::use_tracing_set(ts_, 0);
+    EXPECT_EQ(compat::use_tracing_get(ts_), 0);
+    compat::use_tracing_set(ts_, 1);
+    EXPECT_EQ(compat::use_tracing_get(ts_), 1);
+  }
+}
+
+TEST_F(CompatTest, TracingCounterSilencesACTraceFunction) {
+  coretest::TraceCounter counter("work");
+  run_work();
+  const int traced = counter.watched_events();
+  EXPECT_GT(traced, 0);
+  compat::tracing_add(ts_, 1);
+  run_work();
+  compat::tracing_add(ts_, -1);
+  EXPECT_EQ(counter.watched_events(), traced);
+  run_work();
+  EXPECT_EQ(counter.watched_events(), 2 * traced);
+}
+
+TEST_F(CompatTest, TracingCounterSilencesASysSettraceFunction) {
+  sys_settrace(coretest::item(program_.get(), "python_tracer"));
+  compat::tracing_add(ts_, 1);
+  run_work();
+  compat::tracing_add(ts_, -1);
+  const Py_ssize_t while_suspended = python_events();
+  run_work();
+  const Py_ssize_t after = python_events();
+  sys_settrace(Py_None);
+  EXPECT_EQ(while_suspended, 0);
+  EXPECT_GT(after, 0);
+}
+
+TEST_F(CompatTest, UseTracingOffSilencesTracingUntilSwitchedOn) {
+  coretest::TraceCounter counter("work");
+  compat::use_tracing_set(ts_, 0);
+  run_work();
+  EXPECT_EQ(counter.watched_events(), 0);
+  compat::use_tracing_set(ts_, 1);
+  run_work();
+  EXPECT_GT(counter.watched_events(), 0);
+}
+
+TEST_F(CompatTest, PendingErrorRoundTripsTheSameException) {
+  PyErr_SetString(PyExc_LookupError, "held");
+  Ref original = coretest::take_pending_exception();
+  coretest::set_pending_exception(original.get());
+  compat::PendingError saved;
+  saved.fetch();
+  EXPECT_EQ(PyErr_Occurred(), nullptr);
+  EXPECT_FALSE(saved.empty());
+  PyErr_SetString(PyExc_ValueError, "raised meanwhile");
+  saved.restore();  // replaces what was raised meanwhile
+  Ref back = coretest::take_pending_exception();
+  EXPECT_TRUE(back.is(original.get()));
+}
+
+}  // namespace
