@@ -500,9 +500,18 @@ def test_start_trace_before_init_is_an_error_not_a_crash():
     import subprocess
     code = ("import tvantrel30pydebugstackless as c\n"
             "try:\n    c.start_trace()\nexcept RuntimeError as e:\n    print('refused:', e)\n"
+            "import sys\nf = sys._getframe()\n"
+            "print(c.trace_dispatch(f, 'line', None), c.trace_dispatch(f, 'x', None))\n"
+            "try:\n    c.bootstrap_new_thread(f, 'call', None)\n"
+            "except RuntimeError as e:\n    print('refused:', e)\n"
             "print(c.get_threads(), c.get_tracing())\nc.reset()\nc.step_into()\n"
             "print(c.get_tracing())\n")
     out = subprocess.run([sys.executable, "-c", code], capture_output=True, text=True,
                          timeout=60)
     assert out.returncode == 0, out.stderr
-    assert out.stdout == "refused: init must be called before start_trace\n[] 0\n1\n"
+    lines = out.stdout.splitlines()
+    assert lines[:3] == ["refused: init must be called before start_trace", "None None",
+                         "refused: init must be called before bootstrap_new_thread"]
+    # The line event made a record for the thread (and found tracing off); reset drops it.
+    assert lines[3].startswith("[") and lines[3].endswith("] 1")
+    assert lines[4:] == ["1"]

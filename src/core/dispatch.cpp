@@ -223,6 +223,7 @@ PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args) {
     if (PyErr_Occurred() != nullptr) return nullptr;
     Py_RETURN_NONE;
   }
+  if (!gSelf.trace_dispatch) Py_RETURN_NONE;  // before init there is nothing to keep
   // Switch the thread from the Python-level trampoline to direct C tracing.
   PyThreadState* ts = compat::current_tstate();
   if (gSelf.trace_dispatch && gSelf.trace_dispatch.is(compat::tstate_traceobj(ts)) &&

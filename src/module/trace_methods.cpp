@@ -34,11 +34,18 @@ PyObject* run_step_command(StepCommand command) {
 }
 }  // namespace
 
+namespace {
+// Tracing needs what init stores (the trace function object, the callbacks); before init
+// the methods that would start it refuse instead of tracing with null fields.
+bool initialised(const char* method) {
+  if (gSelf.module && gSelf.trace_dispatch) return true;
+  PyErr_Format(PyExc_RuntimeError, "init must be called before %s", method);
+  return false;
+}
+}  // namespace
+
 PyObject* _tracer_start_trace(PyObject*, PyObject*) {
-  if (!gSelf.module) {
-    PyErr_SetString(PyExc_RuntimeError, "init must be called before start_trace");
-    return nullptr;
-  }
+  if (!initialised("start_trace")) return nullptr;
   if (!__tracer_start_trace()) return nullptr;
   Py_RETURN_NONE;
 }
@@ -87,6 +94,7 @@ PyObject* _tracer_step_out(PyObject*, PyObject*) {
 }
 
 PyObject* _tracer_bootstrap_new_thread(PyObject* self, PyObject* args) {
+  if (!initialised("bootstrap_new_thread")) return nullptr;
   PyThreadState* ts = compat::current_tstate();
   // The interpreter reuses thread-state memory: a record under this pointer belongs to a
   // thread that has ended.
