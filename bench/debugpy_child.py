@@ -62,6 +62,8 @@ class Connection:
             message = self.receive()
             if message is None:
                 raise ConnectionError("the adapter closed the connection")
+            if os.environ.get("BENCH_DAP_TRACE"):
+                print(message, file=sys.stderr)
             if matches(message):
                 return message
 
@@ -77,7 +79,7 @@ def run_client(port, path, line):
     connection.wait_for(response_to(connection.request(
         "initialize", clientID="selvane-bench", adapterID="debugpy", pathFormat="path",
         linesStartAt1=True, columnsStartAt1=True)))
-    connection.request("attach")
+    connection.request("attach", justMyCode=True)  # the editors' default, said explicitly
     connection.wait_for(lambda m: m.get("type") == "event" and m.get("event") == "initialized")
     answer = connection.wait_for(response_to(connection.request(
         "setBreakpoints", source={"path": path}, breakpoints=[{"line": line}])))
@@ -112,6 +114,8 @@ def run_program(iterations, repeats):
     import workload
 
     line = run_bench.never_reached_line(workload.never_called)
+    # The client process below is ours, not a program to debug: debugpy must not follow it.
+    debugpy.configure(subProcess=False)
     host, port = debugpy.listen(("127.0.0.1", 0))
     client = subprocess.Popen(
         [sys.executable, os.path.abspath(__file__), "client", str(port), workload.__file__,

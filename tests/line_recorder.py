@@ -14,6 +14,10 @@ import runpy
 import sys
 import threading
 
+# The scripted server side's imports (the core included): the program must find the same
+# modules already loaded, or its imports would run different import-machinery lines.
+import scripted_server  # noqa: F401
+
 _SELF = os.path.abspath(__file__)
 
 

@@ -338,6 +338,198 @@ print(points, [p.norm() for p in points], cost(15))
 print(dataclasses.asdict(points[0]), dataclasses.replace(points[1], y=9))
 """
 
+UNITTEST = """
+import io
+import unittest
+
+
+def chunks(seq, size):
+    for start in range(0, len(seq), size):
+        yield seq[start:start + size]
+
+
+class ChunkTests(unittest.TestCase):
+    def test_sizes(self):
+        self.assertEqual([len(c) for c in chunks("abcdefg", 3)], [3, 3, 1])
+
+    def test_raises(self):
+        with self.assertRaises(ZeroDivisionError):
+            1 / 0
+
+    def test_subtests(self):
+        for size in (1, 2):
+            with self.subTest(size=size):
+                self.assertTrue(all(chunks("ab", size)))
+
+    def test_failure_is_reported(self):
+        self.assertEqual(list(chunks("", 2)), ["never"])
+
+
+stream = io.StringIO()
+result = unittest.TextTestRunner(stream=stream, verbosity=0).run(
+    unittest.defaultTestLoader.loadTestsFromTestCase(ChunkTests))
+print(result.testsRun, len(result.failures), len(result.errors))
+"""
+
+LOGGING_ARGPARSE = """
+import argparse
+import io
+import logging
+
+parser = argparse.ArgumentParser(prog="tool")
+parser.add_argument("--level", choices=["info", "warning"], default="info")
+parser.add_argument("-n", type=int, default=1)
+parser.add_argument("names", nargs="*")
+args = parser.parse_args(["--level", "warning", "-n", "2", "a", "b"])
+
+buffer = io.StringIO()
+handler = logging.StreamHandler(buffer)
+handler.setFormatter(logging.Formatter("%(levelname)s:%(name)s:%(message)s"))
+log = logging.getLogger("probe")
+log.addHandler(handler)
+log.setLevel(args.level.upper())
+for name in args.names * args.n:
+    log.info("skipped %s", name)
+    log.warning("kept %s", name)
+try:
+    parser.parse_args(["-n", "x"])
+except SystemExit as e:
+    print("usage error", e.code)
+print(buffer.getvalue(), end="")
+"""
+
+LANGUAGE_FEATURES = """
+import asyncio
+import contextlib
+import functools
+import sys
+import weakref
+
+
+def describe(value):
+    match value:
+        case {"kind": "point", "x": x, "y": y} if x == y:
+            return f"diagonal {x}"
+        case [first, *rest]:
+            return f"list starting {first} plus {len(rest)}"
+        case int(n) | float(n) if n < 0:
+            return "negative"
+        case str() as s:
+            return "text " + s
+        case _:
+            return "other"
+
+
+def groups():
+    try:
+        raise ExceptionGroup("many", [ValueError(1), KeyError(2), TypeError(3)])
+    except* ValueError as eg:
+        print("values", len(eg.exceptions))
+    except* (KeyError, TypeError) as eg:
+        print("others", len(eg.exceptions))
+
+
+def finally_return():
+    for i in range(3):
+        try:
+            if i == 1:
+                return i
+        finally:
+            if i == 1:
+                print("finally on return")
+
+
+class Meta(type):
+    def __new__(mcls, name, bases, ns):
+        ns["made_by"] = "Meta"
+        return super().__new__(mcls, name, bases, ns)
+
+
+class Base(metaclass=Meta):
+    registry = []
+
+    def __init_subclass__(cls, **kwargs):
+        super().__init_subclass__(**kwargs)
+        Base.registry.append(cls.__name__)
+
+    def __getattr__(self, name):
+        return f"missing {name}"
+
+
+class Child(Base):
+    @property
+    def broken(self):
+        raise AttributeError("no")
+
+
+class Writer:
+    def __init__(self):
+        self.parts = []
+
+    def write(self, text):
+        self.parts.append(text)
+
+
+class Noisy:
+    def __del__(self):
+        print("deleted")
+
+
+async def ticker(n):
+    for i in range(n):
+        await asyncio.sleep(0)
+        yield i
+
+
+@contextlib.asynccontextmanager
+async def opened():
+    yield "res"
+
+
+async def gathered():
+    async with opened() as r:
+        values = [v async for v in ticker(2)]
+    results = await asyncio.gather(asyncio.sleep(0, "a"), asyncio.sleep(0, "b"))
+    async with asyncio.TaskGroup() as tg:
+        task = tg.create_task(asyncio.sleep(0, "c"))
+    return r, values, results, task.result()
+
+
+def counter_factory():
+    count = 0
+
+    def bump():
+        nonlocal count
+        count += 1
+        return count
+    return bump
+
+
+print([describe(v) for v in [{"kind": "point", "x": 1, "y": 1}, [1, 2, 3], -2, "s", None]])
+groups()
+print(finally_return())
+c = Child()
+print(c.made_by, Base.registry, c.anything, c.broken)
+w = Writer()
+print("to writer", file=w)
+print(w.parts)
+n = Noisy()
+del n
+f = weakref.finalize(Writer(), print, "finalized")
+print(asyncio.run(gathered()))
+bump = counter_factory()
+bump(); bump()
+print(bump(), functools.reduce(lambda a, b: a * b, range(1, 6)), sorted("bca", key=lambda ch: -ord(ch)))
+if (n := len(sys.argv)) > 0 and 0 < n < 5:
+    print("walrus", n)
+with contextlib.ExitStack() as stack:
+    stack.callback(print, "exit stack")
+    with contextlib.suppress(KeyError):
+        {}["k"]
+first, *middle, last = range(5)
+print(first, middle, last, 1 < first + 1 < 3)
+"""
+
 PROGRAMS = {
     "control_flow": CONTROL_FLOW,
     "recursion": RECURSION,
@@ -349,6 +541,12 @@ PROGRAMS = {
     "fractions": FRACTIONS,
     "string_template": TEMPLATE,
     "dataclasses": DATACLASSES,
+    "unittest": UNITTEST,
+    "logging_argparse": LOGGING_ARGPARSE,
+    # match, except*, finally on return, metaclasses, __getattr__ fallbacks, Python code
+    # called from C (print to a writer, __del__, sort keys, weakref.finalize), async
+    # generators, async context managers, gather and TaskGroup, closures, walrus.
+    "language_features": LANGUAGE_FEATURES,
 }
 
 
@@ -357,10 +555,14 @@ def line_stops(run):
 
 
 @pytest.mark.parametrize("name", sorted(PROGRAMS))
-def test_line_stops_are_the_interpreters_line_events(tmp_path, name):
+def test_line_stops_are_the_interpreters_line_events(tmp_path, monkeypatch, name):
+    # Both runs must take the same paths through code that iterates over sets and dicts of
+    # strings: one fixed hash seed for both.
+    monkeypatch.setenv("PYTHONHASHSEED", "0")
     program = write_program(tmp_path, PROGRAMS[name])
     expected = record_lines(tmp_path, program)
-    run = run_traced(tmp_path, program, all_files=True, default="step_into")
+    run = run_traced(tmp_path, program, all_files=True, default="step_into",
+                     max_stops=10_000_000)
     plain = run_plain(tmp_path, program)
     assert (run.returncode, run.stdout) == (plain.returncode, plain.stdout), run.stderr
     assert run.returncode == 0, run.stderr

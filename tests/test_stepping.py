@@ -12,8 +12,8 @@ event sequence; the other commands keep a stop only where the rules of the comma
   step_over            stops in the frame it was given in (line, return and exception
                        events), or anywhere once that frame has left the stack;
   step_over_line(_range)  as step_over, except the frame's events on the given lines;
-  step_out             stops at the return of the frame it was given in and then anywhere
-                       in the caller;
+  step_out             stops at the return of the frame it was given in, then as step_over
+                       in its caller (in a frame without caller: at the next event);
   continue_run         no stepping stop at all;
   stop                 the next event anywhere.
 Set TRACE_DRY_RUN=1 to print the actual lists.
@@ -139,7 +139,9 @@ def test_stop_stops_at_the_next_event_anywhere(tmp_path):
 def test_stop_keeps_a_pending_step_out(tmp_path):
     # exception_mode 1 stops at every exception, so the step_out given at line 8 is
     # interrupted by the KeyError in inner; `stop` there leaves outer as the step-out frame,
-    # and every later event stops, outer's return included.
+    # and every later event stops, outer's return included. (While `stop` is in force every
+    # event stops anyway, so the kept step-out frame only shows where stops are otherwise
+    # suppressed, as during the import callback.)
     source = """
     def inner():
         try:
@@ -343,6 +345,44 @@ def test_step_out_of_a_finishing_generator(tmp_path):
         exc(7, "deleg", "StopIteration"),
         line(8, "deleg"), ret(8, "deleg", "done"),
         line(11),                # deleg is off the stack
+    ])
+
+
+CLOSED_EARLY = """
+def counter():
+    try:
+        yield 1
+        yield 2
+    finally:
+        print("closing")
+
+for v in counter():
+    break
+print("after")
+"""
+
+
+def test_step_into_a_generator_closed_early(tmp_path):
+    run = trace(tmp_path, CLOSED_EARLY, default="step_into")
+    assert run.stdout == "closing\nafter\n"
+    assert_stops(run.stops, [
+        line(1), line(8), line(2, "counter"), line(3, "counter"), ret(3, "counter", 1),
+        line(9),
+        # Leaving the loop drops the generator: closing it throws GeneratorExit in at the
+        # suspended yield, the finally clause runs, and the frame is left by the exception.
+        exc(3, "counter", "GeneratorExit"), line(6, "counter"), ret(6, "counter", None),
+        line(10), ret(10, "<module>", None),
+    ])
+
+
+def test_step_over_in_a_generator_closed_early(tmp_path):
+    # The close runs while the module frame executes line 9: the generator's events are
+    # then a callee's of the module frame, which is the stop frame.
+    run = trace(tmp_path, CLOSED_EARLY, commands=["step_into", "step_into"],
+                default="step_over")
+    assert_stops(run.stops, [
+        line(1), line(8), line(2, "counter"), line(3, "counter"), ret(3, "counter", 1),
+        line(9), line(10), ret(10, "<module>", None),
     ])
 
 
@@ -736,6 +776,21 @@ def test_step_over_line_does_not_stop_at_an_exception_arriving_on_that_line(tmp_
     ])
 
 
+def test_always_stop_mode_stops_in_a_stepped_over_callee(tmp_path):
+    # exception_mode 1 stops at every exception event, whatever the stepping command; the
+    # stepping state then continues from the frame of that stop.
+    run = trace(tmp_path, EXCEPTIONS, exception_mode=1,
+                commands=steps("step_into", 4, "step_over", 4))
+    assert_stops(run.stops, [
+        line(1), line(4), line(8), line(16),
+        line(9, "top"), line(10, "top"),   # step_over at line 10...
+        exc(2, "fail", "ValueError"),      # ...but mode 1 stops here; step_over in fail
+        ret(2, "fail", None),              # fail's own return; step_over
+        exc(5, "middle", "ValueError"),    # fail is gone: next event anywhere; continue_run
+        exc(10, "top", "ValueError"),      # continue_run does not silence mode 1
+    ])
+
+
 def test_continue_run_does_not_stop_at_exceptions(tmp_path):
     run = trace(tmp_path, EXCEPTIONS, commands=["continue_run"], default="step_into")
     assert_stops(run.stops, [line(1)])
@@ -818,6 +873,56 @@ def test_step_over_an_import_statement(tmp_path):
     run = trace(tmp_path, IMPORTER, modules={"helper.py": HELPER},
                 files=["prog.py", "helper.py"], default="step_over")
     assert_stops(run.stops, [line(1), line(2), line(3), ret(3, "<module>", None)])
+
+
+EXECUTED = """
+source = "def inner(v):\\n    return v + 1\\nresult = inner(1)\\n"
+ns = {}
+exec(compile(source, "<generated>", "exec"), ns)
+print(ns["result"])
+"""
+
+
+def test_step_into_code_run_by_exec(tmp_path):
+    # A name of its own: the standard library runs "<string>" code (namedtuple) at start-up.
+    run = trace(tmp_path, EXECUTED, files=["prog.py", "<generated>"], default="step_into")
+    assert run.stdout == "2\n"
+    assert_stops(run.stops, [
+        line(1), line(2), line(3),
+        line(1, file="<generated>"), line(3, file="<generated>"),
+        line(2, "inner", file="<generated>"), ret(2, "inner", 2, file="<generated>"),
+        ret(3, "<module>", None, file="<generated>"),
+        line(4), ret(4, "<module>", None),
+    ])
+
+
+def test_step_over_an_exec_call(tmp_path):
+    run = trace(tmp_path, EXECUTED, files=["prog.py", "<generated>"], default="step_over")
+    assert_stops(run.stops, [line(1), line(2), line(3), line(4), ret(4, "<module>", None)])
+
+
+def test_stepping_in_one_thread_never_stops_another(tmp_path):
+    # The stepping state belongs to the thread that was given the command: the worker's
+    # record starts running freely, so step_into in the main thread stops only there.
+    source = """
+    import threading
+
+    def work():
+        total = 0
+        for i in range(3):
+            total += i
+        print("worker", total)
+
+    t = threading.Thread(target=work)
+    t.start()
+    t.join()
+    print("main")
+    """
+    run = trace(tmp_path, source, default="step_into", record_threads=True)
+    assert run.stdout == "worker 3\nmain\n"
+    assert_stops(run.stops, [stop + ("main",) for stop in [
+        line(1), line(3), line(9), line(10), line(11), line(12), ret(12, "<module>", None),
+    ]])
 
 
 # ---- the bottom frame ------------------------------------------------------------------------

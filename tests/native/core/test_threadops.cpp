@@ -9,8 +9,11 @@
 #include <atomic>
 #include <cerrno>
 #include <cstdint>
-#include <cstdio>
+#include <cstring>
+#include <mutex>
 #include <thread>
+#include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "core_test_support.h"
@@ -162,43 +165,116 @@ TEST_F(ThreadTableTest, RemovingReleasesTheRecordsReferencesAndOnlyThatRecord) {
   EXPECT_EQ(table_.num_entries, 1u);
 }
 
-// The interpreter hands the memory of an ended thread's state to the next one. Whether this
-// run's allocator gives the same address back decides how much the test can show: an
-// allocator with a quarantine (AddressSanitizer's) does not.
+// Makes the interpreter's raw allocator give the memory of one freed block to the next
+// request of the same size, as a plain malloc usually does with a freed thread state. Under
+// AddressSanitizer freed memory is quarantined and the interpreter would never hand out the
+// same thread-state address again, so the reuse is arranged through the interpreter's own
+// allocator hook instead of being left to chance.
+class RawMemoryReuse {
+ public:
+  RawMemoryReuse() {
+    PyMem_GetAllocator(PYMEM_DOMAIN_RAW, &original_);
+    PyMemAllocatorEx hook = {this, hook_malloc, hook_calloc, hook_realloc, hook_free};
+    PyMem_SetAllocator(PYMEM_DOMAIN_RAW, &hook);
+  }
+  ~RawMemoryReuse() {
+    PyMem_SetAllocator(PYMEM_DOMAIN_RAW, &original_);
+    if (kept_ != nullptr) original_.free(original_.ctx, kept_);
+  }
+  RawMemoryReuse(const RawMemoryReuse&) = delete;
+  RawMemoryReuse& operator=(const RawMemoryReuse&) = delete;
+
+  // The next free of `block` keeps it for the next request of its size.
+  void reuse_next(void* block) {
+    std::lock_guard<std::mutex> guard(mutex_);
+    target_ = block;
+  }
+
+ private:
+  static RawMemoryReuse* self(void* ctx) { return static_cast<RawMemoryReuse*>(ctx); }
+  void* take_kept(size_t size) {
+    if (kept_ == nullptr || size != kept_size_) return nullptr;
+    return std::exchange(kept_, nullptr);
+  }
+  void* remember(void* block, size_t size) {
+    if (block != nullptr) sizes_[block] = size;
+    return block;
+  }
+  static void* hook_malloc(void* ctx, size_t size) {
+    RawMemoryReuse* me = self(ctx);
+    std::lock_guard<std::mutex> guard(me->mutex_);
+    if (void* block = me->take_kept(size)) return me->remember(block, size);
+    return me->remember(me->original_.malloc(me->original_.ctx, size), size);
+  }
+  static void* hook_calloc(void* ctx, size_t count, size_t size) {
+    RawMemoryReuse* me = self(ctx);
+    std::lock_guard<std::mutex> guard(me->mutex_);
+    if (void* block = me->take_kept(count * size)) {
+      std::memset(block, 0, count * size);
+      return me->remember(block, count * size);
+    }
+    return me->remember(me->original_.calloc(me->original_.ctx, count, size), count * size);
+  }
+  static void* hook_realloc(void* ctx, void* block, size_t size) {
+    RawMemoryReuse* me = self(ctx);
+    std::lock_guard<std::mutex> guard(me->mutex_);
+    me->sizes_.erase(block);
+    return me->remember(me->original_.realloc(me->original_.ctx, block, size), size);
+  }
+  static void hook_free(void* ctx, void* block) {
+    RawMemoryReuse* me = self(ctx);
+    std::lock_guard<std::mutex> guard(me->mutex_);
+    auto known = me->sizes_.find(block);
+    if (block != nullptr && block == me->target_ && known != me->sizes_.end() &&
+        me->kept_ == nullptr) {
+      me->kept_ = block;
+      me->kept_size_ = known->second;
+      me->target_ = nullptr;
+      me->sizes_.erase(known);
+      return;
+    }
+    if (known != me->sizes_.end()) me->sizes_.erase(known);
+    me->original_.free(me->original_.ctx, block);
+  }
+
+  PyMemAllocatorEx original_{};
+  std::mutex mutex_;
+  std::unordered_map<void*, size_t> sizes_;
+  void* target_ = nullptr;
+  void* kept_ = nullptr;
+  size_t kept_size_ = 0;
+};
+
 TEST_F(ThreadTableTest, ReusedThreadStatePointerFindsTheOldRecordUntilRemoved) {
   PyInterpreterState* interp = PyThreadState_Get()->interp;
-  PyThreadState* old_state = PyThreadState_New(interp);
-  ASSERT_NE(old_state, nullptr);
-  ThreadData* old_record = insert_thread_data(&table_, old_state);
+  RawMemoryReuse reuse;
+  PyThreadState* ended = PyThreadState_New(interp);
+  ASSERT_NE(ended, nullptr);
+  ThreadData* old_record = insert_thread_data(&table_, ended);
   ASSERT_NE(old_record, nullptr);
   Ref old_name = Ref::steal(PyUnicode_FromString("ended thread"));
   old_record->thread_name = old_name;
-  PyThreadState_Clear(old_state);
-  PyThreadState_Delete(old_state);
+  reuse.reuse_next(ended);
+  PyThreadState_Clear(ended);
+  PyThreadState_Delete(ended);
 
-  PyThreadState* new_state_ptr = PyThreadState_New(interp);
-  ASSERT_NE(new_state_ptr, nullptr);
-  extra_states_.push_back(new_state_ptr);
-  // The record is keyed by the old pointer's bytes and never dereferences it again.
-  EXPECT_EQ(find_thread_data(&table_, old_state), old_record);
-  if (new_state_ptr == old_state) {
-    EXPECT_EQ(find_thread_data(&table_, new_state_ptr), old_record);
-    EXPECT_EQ(insert_thread_data(&table_, new_state_ptr), old_record);
-    EXPECT_TRUE(old_record->thread_name.is(old_name.get()));
-    remove_thread_data(&table_, new_state_ptr);
-    EXPECT_EQ(find_thread_data(&table_, new_state_ptr), nullptr);
-    ThreadData* fresh = insert_thread_data(&table_, new_state_ptr);
-    ASSERT_NE(fresh, nullptr);
-    EXPECT_TRUE(fresh->thread_name.is_none());
-    RecordProperty("tstate_reused", "yes");
-  } else {
-    // Different memory: the new thread starts with no record, the old one stays until removed.
-    EXPECT_EQ(find_thread_data(&table_, new_state_ptr), nullptr);
-    remove_thread_data(&table_, old_state);
-    EXPECT_EQ(find_thread_data(&table_, old_state), nullptr);
-    RecordProperty("tstate_reused", "no");
-    std::printf("note: the allocator did not reuse the thread state's memory in this run\n");
-  }
+  PyThreadState* started = PyThreadState_New(interp);
+  ASSERT_NE(started, nullptr);
+  extra_states_.push_back(started);
+  ASSERT_EQ(started, ended) << "the interpreter did not reuse the thread state's memory";
+
+  // The table cannot tell the threads apart: the new one finds the ended one's record...
+  EXPECT_EQ(find_thread_data(&table_, started), old_record);
+  EXPECT_EQ(insert_thread_data(&table_, started), old_record);
+  EXPECT_TRUE(old_record->thread_name.is(old_name.get()));
+  EXPECT_EQ(table_.num_entries, 1u);
+  // ...until that record is removed; then it gets a fresh one.
+  remove_thread_data(&table_, started);
+  EXPECT_EQ(find_thread_data(&table_, started), nullptr);
+  ThreadData* fresh = insert_thread_data(&table_, started);
+  ASSERT_NE(fresh, nullptr);
+  EXPECT_TRUE(fresh->thread_name.is_none());
+  EXPECT_EQ(fresh->tstate, started);
 }
 
 TEST_F(ThreadTableTest, CachedCurrentRecordIsNeverARemovedOne) {
