@@ -9,7 +9,8 @@ The setting is the one a user of an editor has: debugpy listens on the loopback 
 a client (a second process started from here, speaking the Debug Adapter Protocol) attaches,
 sets one breakpoint on a line of the workload's file that is never reached, and finishes the
 configuration; the program then runs freely. The times are of run_bench.timed(), as for the
-other modes: a warm-up run, then REPEATS timed runs.
+other modes: a warm-up run, then REPEATS timed runs. With BENCH_DAP_TRACE=1 in the
+environment the client prints every protocol message it receives to stderr.
 """
 
 import itertools

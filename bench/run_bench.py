@@ -155,7 +155,7 @@ def _init_core(core, line_cb, return_cb, exception_cb):
               None, {})
 
 
-def _check_core_installed(core):
+def _check_core_installed():
     if sys.gettrace() is None:
         raise Failed("start_trace() left the thread without a trace function")
 
@@ -167,7 +167,7 @@ def mode_core_free(n):
     core.continue_run()
     core.start_trace()
     try:
-        _check_core_installed(core)
+        _check_core_installed()
         elapsed = timed(n)
     finally:
         core.stop_trace()
@@ -229,7 +229,7 @@ def mode_core_step_over(n):
     core.step_into()
     core.start_trace()
     try:
-        _check_core_installed(core)
+        _check_core_installed()
         elapsed = _stepped_driver(n)
     finally:
         core.stop_trace()
@@ -249,8 +249,8 @@ def _bdb_class():
         breakpoint bdb costs nothing at all. A debugger session with one breakpoint set,
         somewhere the program does not reach, is the fair equivalent of the core running
         freely: bdb keeps tracing, and since the breakpoint's file is the workload's file it
-        traces every line of the workload's frames (stop_here walks to the stop frame,
-        break_here looks the line up). The one stop, at the first line of the traced call
+        traces every line of the workload's frames (stop_here compares the frame with the
+        stop frame, break_here looks the line up in the file's breakpoints). The one stop, at the first line of the traced call
         and before the timer starts, is answered with set_continue().
         """
 

@@ -25,7 +25,9 @@ constexpr int kClobberedErrno = 9876;
 constexpr int kMarkerErrno = 4242;
 
 // Reference count as a plain number, for before/after comparisons.
-inline Py_ssize_t refs(PyObject* obj) { return Py_REFCNT(obj); }
+inline Py_ssize_t refs(PyObject* obj) {
+  return Py_REFCNT(obj);
+}
 
 // Takes the pending exception out of the thread as one normalised instance (new reference);
 // a null Ref when nothing is pending.

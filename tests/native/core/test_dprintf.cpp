@@ -95,8 +95,8 @@ TEST_F(DPrintfTest, FormatsPointerLongTextAndInts) {
   char expected_pointer[64];
   snprintf(expected_pointer, sizeof expected_pointer, "%p", pointer);
   do_dprintf(kDbgFlow, "p=%p ld=%ld s=%s d=%d i=%i\n", pointer, -1234567890123L, "text", -7, 42);
-  EXPECT_EQ(capture.text(), std::string("p=") + expected_pointer +
-                                " ld=-1234567890123 s=text d=-7 i=42\n");
+  EXPECT_EQ(capture.text(),
+            std::string("p=") + expected_pointer + " ld=-1234567890123 s=text d=-7 i=42\n");
 }
 
 TEST_F(DPrintfTest, UnformattableMessageIsReplacedAndLeavesNoError) {

@@ -107,7 +107,9 @@ TraceCounter::TraceCounter(const char* watched_code_name) : watched_(watched_cod
   PyEval_SetTrace(trace, self.get());
 }
 
-TraceCounter::~TraceCounter() { PyEval_SetTrace(nullptr, nullptr); }
+TraceCounter::~TraceCounter() {
+  PyEval_SetTrace(nullptr, nullptr);
+}
 
 int TraceCounter::trace(PyObject* obj, PyFrameObject* frame, int, PyObject*) {
   auto* self = static_cast<TraceCounter*>(PyCapsule_GetPointer(obj, nullptr));

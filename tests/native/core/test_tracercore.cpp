@@ -55,9 +55,7 @@ class TracerCoreTest : public coretest::TracerStateTest {
     const char* text = value ? PyUnicode_AsUTF8(value.get()) : nullptr;
     return text != nullptr ? text : "";
   }
-  Ref hook_calls_repr() {
-    return Ref::steal(PyObject_Repr(cb("hook_calls")));
-  }
+  Ref hook_calls_repr() { return Ref::steal(PyObject_Repr(cb("hook_calls"))); }
 
   Ref server_;
   Ref module_;
