@@ -28,13 +28,6 @@ namespace {
 // Set by the fork handler in the child; read once per event as a plain flag.
 volatile int gForkSeen = 0;
 
-// The event this thread is dispatching: whether it holds the selvane mutex for it yet.
-struct EventState {
-  PyObject* frame = nullptr;  // borrowed for the duration of the event
-  bool entered = false;
-};
-thread_local EventState* tEvent = nullptr;
-
 class ErrnoGuard {
  public:
   ErrnoGuard() : saved_(errno) {}
@@ -55,19 +48,28 @@ bool debug_output_on() {
   return dprintf_wanted(kDbgFlow | kDbgExceptions | kDbgPathnames);
 }
 
-void leave_debugger(EventState& event) {
+// Takes the mutex for `event` (see enter_debugger).
+void enter_for(ThreadData* data, DispatchEvent& event) {
+  if (event.entered) return;
+  event.entered = true;
+  data->curr_frame = Ref::borrow(event.frame);
+  acquire_selvane_mutex();
+}
+
+void leave_debugger(DispatchEvent& event) {
   if (!event.entered) return;
   __tracer_clear_curr_frame();
   release_selvane_mutex();
   event.entered = false;
 }
 
-int dispatch_by_event(PyFrameObject* frame, int what, PyObject* arg, bool* propagate) {
+int dispatch_by_event(ThreadData* data, PyFrameObject* frame, int what, PyObject* arg,
+                      bool* propagate) {
   PyObject* f = reinterpret_cast<PyObject*>(frame);
   int result = 0;
   switch (what) {
     case PyTrace_CALL:
-      result = dispatch_call(f);
+      result = dispatch_call_for(data, f);
       if (result == -2) {
         do_dprintf(kDbgFlow, "PROPAGATING EXCEPTION INTO USER CODE\n");
         *propagate = true;
@@ -83,11 +85,12 @@ int dispatch_by_event(PyFrameObject* frame, int what, PyObject* arg, bool* propa
       if (result != 0) do_dprintf(kDbgFlow, "TRACER EXC STOPPED TRACER\n");
       return result != 0 ? -1 : 0;
     case PyTrace_LINE:
-      result = dispatch_line(f);
+      result = dispatch_line_for(data, f);
       if (result != 0) do_dprintf(kDbgFlow, "TRACER LINE STOPPED TRACER\n");
       return result != 0 ? -1 : 0;
     case PyTrace_RETURN:
-      result = dispatch_return(f, compat::return_value_of_event(frame, arg));
+      result = dispatch_return_for(
+          data, f, compat::return_value_of_event(data->last_exception_frame, frame, arg));
       if (result != 0) do_dprintf(kDbgFlow, "TRACER RETURN STOPPED TRACER\n");
       return result != 0 ? -1 : 0;
     default:
@@ -95,38 +98,31 @@ int dispatch_by_event(PyFrameObject* frame, int what, PyObject* arg, bool* propa
   }
 }
 
-PyObject* f_trace_name() {
-  static PyObject* name = PyUnicode_InternFromString("f_trace");
-  return name;
-}
-
 // A new frame gets trace_dispatch in f_trace when the thread traces through it, so that
 // jumps (setting f_lineno) work from the callbacks.
-void give_frame_f_trace(PyFrameObject* frame) {
-  PyThreadState* ts = compat::current_tstate();
-  if (!gSelf.trace_dispatch || !gSelf.trace_dispatch.is(compat::tstate_traceobj(ts))) return;
+void give_frame_f_trace(PyThreadState* ts, PyFrameObject* frame) {
+  if (!gSelf.trace_dispatch.is(compat::tstate_traceobj(ts))) return;
   PyObject* f = reinterpret_cast<PyObject*>(frame);
-  Ref current = Ref::steal(PyObject_GetAttr(f, f_trace_name()));
+  Ref current = compat::frame_get_trace(f);
   if (current && !current.is_none()) return;
-  if (PyObject_SetAttr(f, f_trace_name(), gSelf.trace_dispatch.get()) != 0 || !current) {
-    PyErr_Clear();
-  }
+  if (!current || compat::frame_set_trace(f, gSelf.trace_dispatch.get()) != 0) PyErr_Clear();
 }
 
 // Steps 8 to 11 of an event, once the thread may enter. Returns the trace function's result.
-int run_event(PyFrameObject* frame, int what, PyObject* arg) {
+int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int what,
+              PyObject* arg) {
   bool stopped = false;
   bool propagate = false;
-  if (!__ensure_tracer_status()) {
+  if (!ensure_tracer_status_for(ts, data)) {
     do_dprintf(kDbgFlow, "TRACER STOPPED WHILE WAITING FOR MUTEX\n");
   } else {
     ++gSelf.instruction_count;
-    if (do_idle() != 0) {
+    if (gSelf.idle_period > 0 && do_idle() != 0) {
       do_dprintf(kDbgFlow, "IDLE STOPPED TRACER\n");
       stopped = true;
     } else {
-      stopped = dispatch_by_event(frame, what, arg, &propagate) != 0;
-      if (!stopped && !propagate && what == PyTrace_CALL) give_frame_f_trace(frame);
+      stopped = dispatch_by_event(data, frame, what, arg, &propagate) != 0;
+      if (!stopped && !propagate && what == PyTrace_CALL) give_frame_f_trace(ts, frame);
     }
   }
   if (stopped || !gSelf.trace_started) {
@@ -134,7 +130,7 @@ int run_event(PyFrameObject* frame, int what, PyObject* arg) {
     // A failed callback switches tracing off for this thread and never raises into the
     // program's frames: the interpreter reports the error as an unraisable exception.
     if (PyErr_Occurred() != nullptr) PyErr_WriteUnraisable(gSelf.trace_dispatch.get());
-    remove_tracer_from_frames(compat::current_tstate());
+    remove_tracer_from_frames(ts);
     set_global_trace_function(0);
     PyErr_Clear();
   }
@@ -148,21 +144,23 @@ void note_fork_in_child() {
 }
 
 void enter_debugger() {
-  EventState* event = tEvent;
-  if (event == nullptr || event->entered) return;
-  event->entered = true;
-  __tracer_set_curr_frame(event->frame);
-  acquire_selvane_mutex();
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data == nullptr) {
+    PyErr_Clear();
+    return;
+  }
+  if (data->dispatch_event != nullptr) enter_for(data, *data->dispatch_event);
 }
 
 int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
   ErrnoGuard errno_guard;
   if (gForkSeen) check_fork();
   if (gSelf.in_forked_child) return 0;
-  compat::note_event(frame, what);
-  unsigned long identity = get_thread_ident();
+  PyThreadState* ts = compat::current_tstate();
+  // The thread state's identity is what get_thread_ident answers, without the call.
+  unsigned long identity = compat::tstate_thread_id(ts);
   if (gSelf.pending_exception_count != 0 &&
-      __tracer_raise_pending_exception(get_current_thread_data(&gSelf.thread_table))) {
+      __tracer_raise_pending_exception(find_thread_data(&gSelf.thread_table, ts))) {
     return -1;
   }
   if (gSelf.selvane_mutex_owner == identity) {
@@ -173,18 +171,26 @@ int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
     do_dprintf(kDbgFlow, "ignoring thread in c_dispatch\n");
     return 0;
   }
-  if (!__should_debug_thread(identity)) {
+  if (gSelf.debug_thread_cb && !__should_debug_thread(identity)) {
     do_dprintf(kDbgFlow, "ignore thread by policy\n");
     return 0;
   }
-  EventState event{reinterpret_cast<PyObject*>(frame), false};
-  EventState* outer = tEvent;
-  tEvent = &event;
+  ThreadData* data = thread_data_for(&gSelf.thread_table, ts);
+  if (data == nullptr) {
+    PyErr_Clear();
+    return 0;
+  }
+  compat::note_event(data->last_exception_frame, frame, what);
+  DispatchEvent event{reinterpret_cast<PyObject*>(frame), false, data->dispatch_event};
+  data->dispatch_event = &event;
+  uint64_t generation = thread_table_generation();
   // Another thread inside the debugger: wait for it here, before anything is decided.
-  if (gSelf.selvane_mutex_owner != kNoMutexOwner || debug_output_on()) enter_debugger();
-  int result = run_event(frame, what, arg);
+  if (gSelf.selvane_mutex_owner != kNoMutexOwner || debug_output_on()) enter_for(data, event);
+  int result = run_event(ts, data, frame, what, arg);
+  // The callbacks may have reset the core, taking the record with them.
+  if (generation != thread_table_generation()) data = find_thread_data(&gSelf.thread_table, ts);
+  if (data != nullptr && data->dispatch_event == &event) data->dispatch_event = event.outer;
   leave_debugger(event);
-  tEvent = outer;
   return result;
 }
 
@@ -235,29 +241,31 @@ PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args) {
 }
 
 int __ensure_tracer_status() {
-  unsigned long identity = get_thread_ident();
-  if (!gSelf.trace_started) {
-    enter_debugger();
-    do_dprintf(kDbgFlow, "trace_dispatch called while not tracing; thread = %ld\n", identity);
-    remove_tracer_from_frames(compat::current_tstate());
-    set_global_trace_function(0);
-    return 0;
-  }
-  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  PyThreadState* ts = compat::current_tstate();
+  ThreadData* data = thread_data_for(&gSelf.thread_table, ts);
   if (data == nullptr) {
     DLOGEXCEPTION();
     PyErr_Clear();
     return 0;
   }
-  if (!data->tracer_in_frames) {
+  return ensure_tracer_status_for(ts, data);
+}
+
+int ensure_tracer_status_for(PyThreadState* ts, ThreadData* data) {
+  if (!gSelf.trace_started) {
     enter_debugger();
-    install_tracer_into_frames(compat::current_tstate());
+    do_dprintf(kDbgFlow, "trace_dispatch called while not tracing; thread = %ld\n",
+               compat::tstate_thread_id(ts));
+    remove_tracer_from_frames(ts);
+    set_global_trace_function(0);
+    return 0;
   }
-  data = current_thread_data_or_insert(&gSelf.thread_table);
-  if (data != nullptr && !data->global_trace_set) {
-    enter_debugger();
-    set_global_trace_function(1);
-  }
+  if (data->tracer_in_frames && data->global_trace_set) return 1;
+  enter_debugger();
+  if (!data->tracer_in_frames) install_tracer_into_frames(ts);
+  // Installing may run code that resets the core: look the record up again.
+  data = thread_data_for(&gSelf.thread_table, ts);
+  if (data != nullptr && !data->global_trace_set) set_global_trace_function(1);
   return 1;
 }
 
@@ -301,62 +309,69 @@ int register_function_code(PyObject* frame) {
 }  // namespace
 
 int dispatch_call(PyObject* frame) {
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data == nullptr) {
+    PyErr_Clear();
+    return 0;
+  }
+  return dispatch_call_for(data, frame);
+}
+
+int dispatch_call_for(ThreadData* data, PyObject* frame) {
   if (!gSelf.trace_started) return -1;
   if (!compat::is_plain_frame(frame)) return 0;
   print_call(frame);
   if (!is_module_level(frame)) {
     if (register_function_code(frame) == -2) return -2;
   }
-  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
-  if (data == nullptr) {
-    PyErr_Clear();
-    return 0;
-  }
   if (data->bot_frame.is_none()) data->bot_frame = Ref::borrow(frame);
   return 0;
 }
 
 int dispatch_line(PyObject* frame) {
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data == nullptr) {
+    PyErr_Clear();
+    return 0;
+  }
+  return dispatch_line_for(data, frame);
+}
+
+int dispatch_line_for(ThreadData* data, PyObject* frame) {
   if (!gSelf.trace_started) return -1;
   if (!compat::is_plain_frame(frame)) return 0;
-  compat::PendingError saved;
-  saved.fetch();
   if (dprintf_wanted(kDbgFlow)) {
     const char* path = __tracer_get_full_path(&gSelf.co_pathname_table, frame);
     if (path == nullptr) PyErr_Clear();
     do_dprintf(kDbgFlow, "in dispatch_line: file=%s, lineno=%d\n", dprint_check_str(path),
                PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(frame)));
   }
-  int result = 0;
-  if (__tracer_stop_here(frame, 1) ||
-      __tracer_break_here(&gSelf.bp_ops_data, 1, current_thread_data_or_insert(&gSelf.thread_table),
-                          frame, 1)) {
-    if (do_callback(gSelf.line_cb.get(), frame, nullptr) != 0) result = -1;
+  if (!stop_here_for(data, frame, 1) &&
+      !__tracer_break_here(&gSelf.bp_ops_data, 1, data, frame, 1)) {
+    return 0;
   }
-  if (result == 0) {
+  // Only a stop runs Python code: the thread's exception state is kept around it, and a
+  // failing callback's error is what the interpreter reports.
+  compat::PendingError saved;
+  saved.fetch();
+  if (do_callback(gSelf.line_cb.get(), frame, nullptr) == 0) {
     saved.restore();
-  } else {
-    // The callback's error is what the interpreter must report; the saved state is dropped.
-    compat::PendingError failure;
-    failure.fetch();
-    saved.restore();
-    PyErr_Clear();
-    failure.restore();
+    return 0;
   }
-  return result;
+  compat::PendingError failure;
+  failure.fetch();
+  saved.restore();
+  PyErr_Clear();
+  failure.restore();
+  return -1;
 }
 
 namespace {
 
-Ref frame_f_trace(PyObject* frame) {
-  Ref trace = Ref::steal(PyObject_GetAttr(frame, f_trace_name()));
-  if (!trace) PyErr_Clear();
-  return trace;
-}
-
 bool untraced_after_stop(PyObject* frame) {
   if (gSelf.trace_started) return false;
-  Ref trace = frame_f_trace(frame);
+  Ref trace = compat::frame_get_trace(frame);
+  if (!trace) PyErr_Clear();
   return !trace || trace.is_none();
 }
 
@@ -372,23 +387,33 @@ void call_quit_cb_if_autoquit() {
 }
 
 int dispatch_return(PyObject* frame, PyObject* retval) {
-  if (!gSelf.trace_started) return -1;
-  if (retval == nullptr) {
-    if (dispatch_exception_return(frame, nullptr) != 0) return -1;
-    if (untraced_after_stop(frame)) return 0;
-  }
   ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
   if (data == nullptr) {
     PyErr_Clear();
     return 0;
   }
-  bool stop = data->step_out_frame.is(frame) || __tracer_stop_here(frame, 2);
+  return dispatch_return_for(data, frame, retval);
+}
+
+int dispatch_return_for(ThreadData* data, PyObject* frame, PyObject* retval) {
+  if (!gSelf.trace_started) return -1;
+  if (retval == nullptr) {
+    if (dispatch_exception_return(frame, nullptr) != 0) return -1;
+    if (untraced_after_stop(frame)) return 0;
+    // Giving up the bottom frame may have run code: the record is looked up again.
+    data = current_thread_data_or_insert(&gSelf.thread_table);
+    if (data == nullptr) {
+      PyErr_Clear();
+      return 0;
+    }
+  }
+  bool stop = data->step_out_frame.is(frame) || stop_here_for(data, frame, 2);
   if (stop) {
-    return do_callback(gSelf.return_cb.get(), frame, retval != nullptr ? retval : Py_None) != 0 ? -1
-                                                                                                : 0;
+    PyObject* value = retval != nullptr ? retval : Py_None;
+    return do_callback(gSelf.return_cb.get(), frame, value) != 0 ? -1 : 0;
   }
   if (data->bot_frame.is(frame)) {
-    unsigned long identity = get_thread_ident();
+    unsigned long identity = data->thread_id;
     enter_debugger();  // dropping the frame may run finalizers
     data->bot_frame = Ref::none();
     call_quit_cb_if_autoquit();

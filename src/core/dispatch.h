@@ -17,6 +17,20 @@ int dispatch_line(PyObject* frame);
 int dispatch_return(PyObject* frame, PyObject* retval);
 
 int __ensure_tracer_status();
+
+// The event a thread is dispatching, kept on the dispatcher's stack and reachable from the
+// thread's record: whether the thread holds the selvane mutex for it yet.
+struct DispatchEvent {
+  PyObject* frame;        // borrowed for the duration of the event
+  bool entered;           // the thread holds the mutex and its current frame is set
+  DispatchEvent* outer;   // an event this one interrupted, or null
+};
+
+// The handlers for a thread whose record the dispatcher already holds.
+int dispatch_call_for(ThreadData* data, PyObject* frame);
+int dispatch_line_for(ThreadData* data, PyObject* frame);
+int dispatch_return_for(ThreadData* data, PyObject* frame, PyObject* retval);
+int ensure_tracer_status_for(PyThreadState* ts, ThreadData* data);
 int do_callback(PyObject* cb, PyObject* frame, PyObject* arg);
 int do_idle();
 

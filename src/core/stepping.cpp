@@ -59,6 +59,18 @@ int __tracer_stop_here(PyObject* frame, int event) {
     do_dprintf(kDbgFlow, "ERROR: UNEXPECTED thread_data == NULL (while still tracing)!\n");
     return 0;
   }
+  return stop_here_for(data, frame, event);
+}
+
+int stop_here_for(ThreadData* data, PyObject* frame, int event) {
+  if (gSelf.in_import_cb) {
+    do_dprintf(kDbgFlow, "Not stopping here because import callback is active\n");
+    return 0;
+  }
+  if (!gSelf.trace_started) {
+    do_dprintf(kDbgFlow, "Not stopping here because no longer tracing\n");
+    return 0;
+  }
   if (!data->stop_frame) {
     do_dprintf(kDbgFlow, "Not stopping here because stop_frame == NULL\n");
     return 0;

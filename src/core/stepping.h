@@ -12,6 +12,8 @@
 
 // Event codes for the decision: 1 line, 2 return, -1 exception.
 int __tracer_stop_here(PyObject* frame, int event);
+// The same for a thread whose record the caller already holds.
+int stop_here_for(ThreadData* data, PyObject* frame, int event);
 
 void __tracer_step_into(ThreadData* data);
 void __tracer_step_over(ThreadData* data);

@@ -18,7 +18,7 @@ void set_dprintf_file(PyObject* file) {
   }
 }
 
-void do_dprintf(unsigned int mask, const char* format, ...) {
+void do_dprintf_unchecked(unsigned int mask, const char* format, ...) {
   va_list args;
   va_start(args, format);
   do_dprintfv(mask, format, args);

@@ -31,13 +31,22 @@ enum DPrintfClass : unsigned int {
 // Releases the current file, then keeps `file` unless it is null or None (None silences).
 void set_dprintf_file(PyObject* file);
 
-void do_dprintf(unsigned int mask, const char* format, ...);
 void do_dprintfv(unsigned int mask, const char* format, va_list args);
+// The writer behind do_dprintf, for callers that have already tested the mask.
+void do_dprintf_unchecked(unsigned int mask, const char* format, ...);
 
 // True when a message of class `mask` would be written now. Callers test it before doing
 // expensive work only to build a message.
 inline bool dprintf_wanted(unsigned int mask) noexcept {
   return gDPrintfFile != nullptr && (mask & gDPrintfMask) != 0;
+}
+
+// Prints a message of class `mask`. The test whether anything is written is inline: the
+// dispatcher has messages on every event, and while the channel is off they must cost a
+// load and a branch, not a call.
+template <typename... Args>
+inline void do_dprintf(unsigned int mask, const char* format, Args... args) {
+  if (dprintf_wanted(mask)) do_dprintf_unchecked(mask, format, args...);
 }
 
 // Logs the pending exception (banner plus traceback) to the debug file and leaves it

@@ -194,17 +194,16 @@ inline void locals_to_fast(PyFrameObject* frame, int clear) noexcept {
 // stopped at tells them apart: a frame that really returns or yields stands on
 // RETURN_VALUE, RETURN_CONST or YIELD_VALUE. A generator closed while suspended also stands
 // on YIELD_VALUE while GeneratorExit unwinds it; that case is recognised by the exception
-// event that came just before in the same frame (note_event keeps it, per OS thread).
+// event that came just before in the same frame (note_event keeps it, per thread).
 
-namespace detail {
-inline thread_local PyFrameObject* last_exception_frame = nullptr;
-}
-
-// Remembers whether the latest event of this thread was an exception event, and where.
-inline void note_event(PyFrameObject* frame, int what) noexcept {
+// Remembers whether the latest event of a thread was an exception event, and where, in a
+// slot the caller keeps per thread.
+inline void note_event(PyFrameObject*& last_exception_frame, PyFrameObject* frame,
+                       int what) noexcept {
 #if PY_VERSION_HEX >= 0x030C0000 && PY_VERSION_HEX < 0x030D0000
-  detail::last_exception_frame = what == PyTrace_EXCEPTION ? frame : nullptr;
+  last_exception_frame = what == PyTrace_EXCEPTION ? frame : nullptr;
 #else
+  (void)last_exception_frame;
   (void)frame;
   (void)what;
 #endif
@@ -225,8 +224,9 @@ inline int opcode_at_lasti(PyFrameObject* frame) noexcept {
 #endif
 
 // The value a return event carries: null when the frame is left by an exception, on every
-// version. Borrowed.
-inline PyObject* return_value_of_event(PyFrameObject* frame, PyObject* arg) noexcept {
+// version. Borrowed. `last_exception_frame` is the slot that note_event keeps.
+inline PyObject* return_value_of_event(PyFrameObject* last_exception_frame, PyFrameObject* frame,
+                                       PyObject* arg) noexcept {
 #if PY_VERSION_HEX >= 0x030C0000 && PY_VERSION_HEX < 0x030D0000
   if (arg != Py_None) return arg;
   switch (opcode_at_lasti(frame)) {
@@ -234,14 +234,52 @@ inline PyObject* return_value_of_event(PyFrameObject* frame, PyObject* arg) noex
     case RETURN_CONST:
       return arg;
     case YIELD_VALUE:
-      return detail::last_exception_frame == frame ? nullptr : arg;
+      return last_exception_frame == frame ? nullptr : arg;
     default:
       return nullptr;
   }
 #else
+  (void)last_exception_frame;
   (void)frame;
   return arg;
 #endif
+}
+
+// ---- f_trace -------------------------------------------------------------------------------
+//
+// Frames are opaque from 3.11 on, so f_trace is an attribute. Going through the frame type's
+// own descriptor, found once, spares the attribute lookup on every call event.
+
+inline PyGetSetDef* frame_f_trace_getset() noexcept {
+  static PyGetSetDef* getset = [] {
+    PyObject* descr =
+        PyObject_GetAttrString(reinterpret_cast<PyObject*>(&PyFrame_Type), "f_trace");
+    PyGetSetDef* def = nullptr;
+    if (descr != nullptr && Py_IS_TYPE(descr, &PyGetSetDescr_Type)) {
+      def = reinterpret_cast<PyGetSetDescrObject*>(descr)->d_getset;
+    }
+    if (descr == nullptr) PyErr_Clear();
+    // The descriptor stays in the frame type's dictionary for the life of the process.
+    Py_XDECREF(descr);
+    return def;
+  }();
+  return getset;
+}
+
+// New reference to the frame's f_trace (None when unset), or null with an error set.
+inline Ref frame_get_trace(PyObject* frame) noexcept {
+  PyGetSetDef* getset = frame_f_trace_getset();
+  if (getset != nullptr && getset->get != nullptr) {
+    return Ref::steal(getset->get(frame, getset->closure));
+  }
+  return Ref::steal(PyObject_GetAttrString(frame, "f_trace"));
+}
+
+// Sets the frame's f_trace (None clears it); 0, or -1 with an error set.
+inline int frame_set_trace(PyObject* frame, PyObject* value) noexcept {
+  PyGetSetDef* getset = frame_f_trace_getset();
+  if (getset != nullptr && getset->set != nullptr) return getset->set(frame, value, getset->closure);
+  return PyObject_SetAttrString(frame, "f_trace", value);
 }
 
 }  // namespace compat

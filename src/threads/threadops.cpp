@@ -12,17 +12,20 @@
 unsigned long (*gGetThreadIdentFunc)(void) = nullptr;
 
 namespace {
-// Bumped whenever a record leaves a table, so that cached record pointers are never used
+// Bumped whenever a record leaves a table, so that a cached record pointer is never used
 // after the record is freed.
 uint64_t gThreadTableGeneration = 1;
 
+// The record found last. One entry is enough: events come in runs from one thread, and
+// the interpreter lock serialises every use, so a plain global needs no thread-local
+// storage (which costs a call per access in a shared object).
 struct CachedRecord {
   CU_HashTable* table = nullptr;
   PyThreadState* tstate = nullptr;
   ThreadData* data = nullptr;
   uint64_t generation = 0;
 };
-thread_local CachedRecord tCachedRecord;
+CachedRecord gCachedRecord;
 }  // namespace
 
 void init_threadops() {
@@ -157,9 +160,8 @@ PyThreadState* tstate_ptr_for_id(PyObject* id) {
   return static_cast<PyThreadState*>(PyLong_AsVoidPtr(id));
 }
 
-ThreadData* current_thread_data_or_insert(CU_HashTable* table) {
-  PyThreadState* tstate = compat::current_tstate();
-  CachedRecord& cache = tCachedRecord;
+ThreadData* thread_data_for(CU_HashTable* table, PyThreadState* tstate) {
+  CachedRecord& cache = gCachedRecord;
   if (cache.tstate == tstate && cache.table == table &&
       cache.generation == gThreadTableGeneration && tstate != nullptr) {
     return cache.data;
@@ -169,3 +171,9 @@ ThreadData* current_thread_data_or_insert(CU_HashTable* table) {
   if (data != nullptr) cache = CachedRecord{table, tstate, data, gThreadTableGeneration};
   return data;
 }
+
+ThreadData* current_thread_data_or_insert(CU_HashTable* table) {
+  return thread_data_for(table, compat::current_tstate());
+}
+
+uint64_t thread_table_generation() { return gThreadTableGeneration; }

@@ -31,12 +31,24 @@ struct ThreadData {
   Ref sub_language_hook;          // owned or null: the active sub-language hook object
   int32_t leaving_bot_frame = 0;  // 1 once an exception left the bottom frame
   Ref pending_exception;          // owned or null: exception to raise at the next event
+  // The event this thread is dispatching right now, or null (owned by the dispatcher's
+  // stack frame): how the dispatcher's helpers learn whether the thread holds the selvane
+  // mutex for it yet.
+  struct DispatchEvent* dispatch_event = nullptr;
+  // Borrowed, only compared: the frame of the thread's latest event if that was an
+  // exception event (tells a frame left by an exception where the interpreter does not).
+  PyFrameObject* last_exception_frame = nullptr;
 };
 
 // The record of the calling thread, created when missing (null with MemoryError set when it
 // cannot be). Answered from a per-thread cache on the hot path; any removal from the table
 // invalidates every cache.
 ThreadData* current_thread_data_or_insert(CU_HashTable* table);
+// The same for a given thread state (the dispatcher already has the calling thread's).
+ThreadData* thread_data_for(CU_HashTable* table, PyThreadState* tstate);
+// Changes whenever a record leaves a table: a record pointer taken under the same value is
+// still valid.
+uint64_t thread_table_generation();
 
 // The interpreter's thread-identity function, found at load, or null.
 extern unsigned long (*gGetThreadIdentFunc)(void);
