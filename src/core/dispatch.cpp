@@ -109,8 +109,7 @@ void give_frame_f_trace(PyThreadState* ts, PyFrameObject* frame) {
 }
 
 // Steps 8 to 11 of an event, once the thread may enter. Returns the trace function's result.
-int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int what,
-              PyObject* arg) {
+int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int what, PyObject* arg) {
   bool stopped = false;
   bool propagate = false;
   if (!ensure_tracer_status_for(ts, data)) {

@@ -21,9 +21,9 @@ int __ensure_tracer_status();
 // The event a thread is dispatching, kept on the dispatcher's stack and reachable from the
 // thread's record: whether the thread holds the selvane mutex for it yet.
 struct DispatchEvent {
-  PyObject* frame;        // borrowed for the duration of the event
-  bool entered;           // the thread holds the mutex and its current frame is set
-  DispatchEvent* outer;   // an event this one interrupted, or null
+  PyObject* frame;       // borrowed for the duration of the event
+  bool entered;          // the thread holds the mutex and its current frame is set
+  DispatchEvent* outer;  // an event this one interrupted, or null
 };
 
 // The handlers for a thread whose record the dispatcher already holds.

@@ -183,3 +183,10 @@ void __tracer_clear_curr_frame() {
   ThreadData* data = current_thread_record();
   if (data != nullptr) data->curr_frame = Ref::none();
 }
+
+void __tracer_forget_thread(PyThreadState* tstate) {
+  ThreadData* data = find_thread_data(&gSelf.thread_table, tstate);
+  if (data == nullptr) return;
+  if (data->pending_exception) --gSelf.pending_exception_count;
+  remove_thread_data(&gSelf.thread_table, tstate);
+}

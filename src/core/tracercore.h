@@ -93,4 +93,6 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
 void __tracer_reset();
 void __tracer_destroy();
 void __tracer_set_curr_frame(PyObject* frame);
+// Removes a thread's record, giving up an exception still pending for it.
+void __tracer_forget_thread(PyThreadState* tstate);
 void __tracer_clear_curr_frame();

@@ -98,7 +98,7 @@ PyObject* _tracer_bootstrap_new_thread(PyObject* self, PyObject* args) {
   PyThreadState* ts = compat::current_tstate();
   // The interpreter reuses thread-state memory: a record under this pointer belongs to a
   // thread that has ended.
-  remove_thread_data(&gSelf.thread_table, ts);
+  __tracer_forget_thread(ts);
   install_tracer_into_frames(ts);
   set_global_trace_function(1);
   return _tracer_trace_dispatch(self, args);
@@ -112,7 +112,7 @@ PyObject* _tracer_thread_exiting(PyObject*, PyObject*) {
     PyEval_SetTrace(nullptr, nullptr);
     if (PyErr_Occurred() != nullptr) return nullptr;
   }
-  remove_thread_data(&gSelf.thread_table, ts);
+  __tracer_forget_thread(ts);
   // Thread identities are reused too: a later thread must be asked about afresh.
   __clear_should_debug_thread_cache(get_thread_ident());
   Py_RETURN_NONE;

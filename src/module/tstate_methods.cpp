@@ -68,7 +68,10 @@ PyObject* get_tstate_tracing(PyObject*, PyObject* args) {
 PyObject* set_tstate_use_tracing(PyObject*, PyObject* args) {
   int value = 0;
   if (!PyArg_ParseTuple(args, "i:set_tstate_use_tracing", &value)) return nullptr;
-  compat::use_tracing_set(compat::current_tstate(), value);
+  if (!compat::use_tracing_set(compat::current_tstate(), value)) {
+    PyErr_SetString(PyExc_MemoryError, "Out of memory");
+    return nullptr;
+  }
   Py_RETURN_NONE;
 }
 

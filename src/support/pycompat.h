@@ -16,6 +16,10 @@
 #include <opcode.h>
 #endif
 
+#include <cstdint>
+#include <new>
+#include <unordered_set>
+
 #include "support/ref.h"
 
 namespace compat {
@@ -83,18 +87,27 @@ inline bool set_trace_all_threads(Py_tracefunc func, PyObject* obj) noexcept {
 // (3.12+ also silences sys.monitoring tools then). 3.11 keeps a separate per-thread flag,
 // `cframe->use_tracing`, that the interpreter recomputes whenever a callback returns or a
 // hook is set, and 3.12+ has no such flag at all. So the switch is built on the counter on
-// every version: switching it off adds one hidden unit to `tracing` (remembered per OS
-// thread), switching it on removes it. The counter that callers read and adjust is the
-// interpreter's minus that hidden unit, so the two contracts stay independent.
+// every version: switching it off adds one hidden unit to that thread state's `tracing`,
+// switching it on removes it. The counter that callers read and adjust is the interpreter's
+// minus that hidden unit, so the two contracts stay independent. The thread states holding
+// a hidden unit are remembered by their id, which the interpreter never reuses (addresses
+// it does); an OS thread may also run several thread states one after another.
 
 namespace detail {
-inline thread_local bool use_tracing_off = false;
+inline std::unordered_set<uint64_t>& use_tracing_off_ids() {
+  static auto* ids = new std::unordered_set<uint64_t>();  // lives as long as the process
+  return *ids;
 }
+inline bool use_tracing_is_off(PyThreadState* ts) {
+  auto& ids = use_tracing_off_ids();
+  return !ids.empty() && ids.count(PyThreadState_GetID(ts)) != 0;
+}
+}  // namespace detail
 
 // The thread's tracing depth as callers see it (the interpreter's counter without the unit
 // that a switched-off use_tracing holds).
 inline int tracing_get(PyThreadState* ts) noexcept {
-  return ts->tracing - (detail::use_tracing_off ? 1 : 0);
+  return ts->tracing - (detail::use_tracing_is_off(ts) ? 1 : 0);
 }
 inline void tracing_add(PyThreadState* ts, int delta) noexcept {
   ts->tracing += delta;
@@ -102,20 +115,28 @@ inline void tracing_add(PyThreadState* ts, int delta) noexcept {
 
 // 1 when trace and profile functions would be called in this thread now, else 0.
 inline int use_tracing_get(PyThreadState* ts) noexcept {
-  if (detail::use_tracing_off) return 0;
+  if (detail::use_tracing_is_off(ts)) return 0;
   return (ts->tracing == 0 && tstate_has_trace_or_profile(ts)) ? 1 : 0;
 }
 
 // 0 stops trace and profile calls in the calling thread until a non-zero value is set.
-inline void use_tracing_set(PyThreadState* ts, int value) noexcept {
+// Returns false only when remembering the thread failed (out of memory).
+inline bool use_tracing_set(PyThreadState* ts, int value) noexcept {
   bool off = value == 0;
-  if (off == detail::use_tracing_off) return;
-  detail::use_tracing_off = off;
+  if (off == detail::use_tracing_is_off(ts)) return true;
+  uint64_t id = PyThreadState_GetID(ts);
   if (off) {
+    try {
+      detail::use_tracing_off_ids().insert(id);
+    } catch (const std::bad_alloc&) {
+      return false;
+    }
     PyThreadState_EnterTracing(ts);
   } else {
+    detail::use_tracing_off_ids().erase(id);
     PyThreadState_LeaveTracing(ts);
   }
+  return true;
 }
 
 // ---- The pending exception -------------------------------------------------------------
@@ -252,8 +273,7 @@ inline PyObject* return_value_of_event(PyFrameObject* last_exception_frame, PyFr
 
 inline PyGetSetDef* frame_f_trace_getset() noexcept {
   static PyGetSetDef* getset = [] {
-    PyObject* descr =
-        PyObject_GetAttrString(reinterpret_cast<PyObject*>(&PyFrame_Type), "f_trace");
+    PyObject* descr = PyObject_GetAttrString(reinterpret_cast<PyObject*>(&PyFrame_Type), "f_trace");
     PyGetSetDef* def = nullptr;
     if (descr != nullptr && Py_IS_TYPE(descr, &PyGetSetDescr_Type)) {
       def = reinterpret_cast<PyGetSetDescrObject*>(descr)->d_getset;
@@ -278,7 +298,8 @@ inline Ref frame_get_trace(PyObject* frame) noexcept {
 // Sets the frame's f_trace (None clears it); 0, or -1 with an error set.
 inline int frame_set_trace(PyObject* frame, PyObject* value) noexcept {
   PyGetSetDef* getset = frame_f_trace_getset();
-  if (getset != nullptr && getset->set != nullptr) return getset->set(frame, value, getset->closure);
+  if (getset != nullptr && getset->set != nullptr)
+    return getset->set(frame, value, getset->closure);
   return PyObject_SetAttrString(frame, "f_trace", value);
 }
 

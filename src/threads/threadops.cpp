@@ -176,4 +176,6 @@ ThreadData* current_thread_data_or_insert(CU_HashTable* table) {
   return thread_data_for(table, compat::current_tstate());
 }
 
-uint64_t thread_table_generation() { return gThreadTableGeneration; }
+uint64_t thread_table_generation() {
+  return gThreadTableGeneration;
+}

@@ -5,6 +5,8 @@
 
 #include <gtest/gtest.h>
 
+#include <thread>
+
 #include "core_test_support.h"
 
 namespace {
@@ -136,6 +138,31 @@ TEST_F(CompatTest, PendingErrorRoundTripsTheSameException) {
   saved.restore();  // replaces what was raised meanwhile
   Ref back = coretest::take_pending_exception();
   EXPECT_TRUE(back.is(original.get()));
+}
+
+TEST_F(CompatTest, UseTracingSwitchBelongsToTheThreadStateNotTheOsThread) {
+  // An OS thread may run several thread states one after another (PyGILState_Ensure and
+  // Release from a C thread): the switch set in one must not show in the next.
+  int first_off = -1, second_tracing = -1, second_raw = -1, second_use = -1;
+  Py_BEGIN_ALLOW_THREADS std::thread worker([&] {
+    PyGILState_STATE state = PyGILState_Ensure();
+    PyThreadState* first = PyThreadState_Get();
+    compat::use_tracing_set(first, 0);
+    first_off = compat::use_tracing_get(first);
+    PyGILState_Release(state);  // the thread state goes, still switched off
+    state = PyGILState_Ensure();
+    PyThreadState* second = PyThreadState_Get();
+    second_tracing = compat::tracing_get(second);
+    compat::use_tracing_set(second, 1);  // already on: nothing to undo
+    second_raw = second->tracing;
+    second_use = compat::use_tracing_get(second);
+    PyGILState_Release(state);
+  });
+  worker.join();
+  Py_END_ALLOW_THREADS EXPECT_EQ(first_off, 0);
+  EXPECT_EQ(second_tracing, 0);
+  EXPECT_EQ(second_raw, 0);
+  EXPECT_EQ(second_use, 0);  // no trace function in the new thread state
 }
 
 }  // namespace

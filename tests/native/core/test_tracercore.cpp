@@ -190,6 +190,23 @@ TEST_F(TracerCoreTest, ResetForgetsInjectedExceptionsWithTheirThreads) {
   EXPECT_EQ(gSelf.pending_exception_count, 0);
 }
 
+TEST_F(TracerCoreTest, ForgettingAThreadGivesUpItsInjectedException) {
+  ASSERT_EQ(init(), 1);
+  PyThreadState* ts = PyThreadState_Get();
+  ThreadData* data = insert_thread_data(&gSelf.thread_table, ts);
+  ASSERT_NE(data, nullptr);
+  Ref exc = Ref::steal(PyObject_CallFunction(PyExc_RuntimeError, "s", "injected"));
+  ASSERT_EQ(__tracer_set_pending_exception(data, exc.get()), 1);
+  Py_ssize_t held = Py_REFCNT(exc.get());
+  // What thread_exiting and the thread start hook do with a thread's record.
+  __tracer_forget_thread(ts);
+  EXPECT_EQ(find_thread_data(&gSelf.thread_table, ts), nullptr);
+  EXPECT_EQ(gSelf.pending_exception_count, 0);
+  EXPECT_EQ(Py_REFCNT(exc.get()), held - 1);
+  __tracer_forget_thread(ts);  // no record: nothing to do
+  EXPECT_EQ(gSelf.pending_exception_count, 0);
+}
+
 TEST_F(TracerCoreTest, DestroyAlsoReleasesTheSpareReference) {
   ASSERT_EQ(init(), 1);
   Ref spare = Ref::steal(PyList_New(0));
