@@ -515,3 +515,36 @@ def test_start_trace_before_init_is_an_error_not_a_crash():
     # The line event made a record for the thread (and found tracing off); reset drops it.
     assert lines[3].startswith("[") and lines[3].endswith("] 1")
     assert lines[4:] == ["1"]
+
+
+# ---- stop lists and the new-imports record ------------------------------------------------
+
+
+def test_reset_empties_the_stop_lists_and_the_new_imports():
+    core.set_always_stop_excepts((KeyError,))
+    core.set_never_stop_excepts((ValueError, OSError))
+    assert core.get_always_stop_excepts() == (KeyError,)
+    assert core.get_never_stop_excepts() == (ValueError, OSError)
+    core.reset()
+    assert core.get_always_stop_excepts() == ()
+    assert core.get_never_stop_excepts() == ()
+    assert core.get_new_imports() == []
+    assert core.get_new_imports() == []  # twice in a row: the second is empty too
+
+
+def test_empty_stop_list_stores_nothing_and_bad_types_keep_the_old_one():
+    core.set_always_stop_excepts((KeyError,))
+    with pytest.raises(TypeError):
+        core.set_always_stop_excepts([KeyError])
+    assert core.get_always_stop_excepts() == (KeyError,)
+    core.set_always_stop_excepts(())
+    assert core.get_always_stop_excepts() == ()
+    with pytest.raises(TypeError):
+        core.get_never_stop_excepts(1)
+    assert_core_still_works()
+
+
+def test_get_new_imports_hands_over_a_new_list_each_time():
+    first = core.get_new_imports()
+    second = core.get_new_imports()
+    assert first == [] and second == [] and first is not second

@@ -308,3 +308,17 @@ def test_uncaught_exception_exit_status_passes_through(tmp_path):
     plain = run_plain(tmp_path, program)
     assert traced.returncode == plain.returncode == 1
     assert traced.stderr.strip().splitlines()[-1] == plain.stderr.strip().splitlines()[-1]
+
+
+def test_reset_keeps_the_line_callback(tmp_path):
+    program = """
+        a = 1
+        b = 2
+    """
+    # Reset from the first stop: the core stops tracing, but keeps its callbacks; the
+    # server starts tracing again and the line callback is still the one given to init.
+    run = ok(run_traced(tmp_path, program,
+                        commands=[["seq", "reset", "step_into", "start_trace"]],
+                        default="continue_run"))
+    assert_stops(run.stops, [("line", "prog.py", 1, "<module>"),
+                             ("line", "prog.py", 2, "<module>")])

@@ -32,9 +32,15 @@ int dispatch_exception(PyObject* frame, PyObject* exc_arg) {
   return 0;
 }
 
-int stop_at_exception_no_filters(PyObject*, PyObject*) {
+int stop_at_exception_no_filters(PyObject*, PyObject* exc_type) {
   do_dprintf(kDbgExceptions, "stop_at_exception_no_filters\n");
-  return gSelf.exception_mode == kExcAlwaysStop ? 1 : 0;
+  if (gSelf.exception_mode == kExcAlwaysStop) return 1;
+  if (gSelf.never_stop_excepts &&
+      PyErr_GivenExceptionMatches(exc_type, gSelf.never_stop_excepts.get())) {
+    do_dprintf(kDbgFlow, "  never stop\n");
+    return 0;
+  }
+  return 0;
 }
 
 int do_exception_callback_if_not_filtered(PyObject* frame, PyObject* exc_arg) {

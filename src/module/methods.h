@@ -47,3 +47,12 @@ PyObject* _tracer_bootstrap_new_thread(PyObject* self, PyObject* args);
 PyObject* _tracer_thread_exiting(PyObject* self, PyObject* args);
 PyObject* _tracer_is_internal_frame(PyObject* self, PyObject* args);
 PyObject* raise_exception(PyObject* self, PyObject* args);
+
+// exception_methods.cpp: the exception stop lists.
+PyObject* set_always_stop_excepts(PyObject* self, PyObject* args);
+PyObject* get_always_stop_excepts(PyObject* self, PyObject* args);
+PyObject* set_never_stop_excepts(PyObject* self, PyObject* args);
+PyObject* get_never_stop_excepts(PyObject* self, PyObject* args);
+
+// import_methods.cpp: the record of newly imported modules.
+PyObject* _tracer_get_new_imports(PyObject* self, PyObject* args);

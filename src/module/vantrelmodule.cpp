@@ -143,6 +143,18 @@ PyMethodDef gMethods[] = {
     METHOD("get_current_tstate_id", get_current_tstate_id, "Returns id of current thread state"),
     METHOD("get_thread_ident_for_tstate_id", get_thread_ident_for_tstate_id,
            "Returns id returned by thread.get_ident for given tstate_id"),
+    METHOD("set_always_stop_excepts", set_always_stop_excepts,
+           "Set the tuple of exception types to always stop on"),
+    METHOD("get_always_stop_excepts", get_always_stop_excepts,
+           "Get the tuple of exception types to always stop on"),
+    METHOD("set_never_stop_excepts", set_never_stop_excepts,
+           "Set the tuple of exception types to never stop on"),
+    METHOD("get_never_stop_excepts", get_never_stop_excepts,
+           "Get the tuple of exception types to never stop on"),
+    METHOD("get_new_imports", _tracer_get_new_imports,
+           "Used to obtain list of full path names for modules that have been\nloaded or "
+           "reloaded since the last call to this function.  Also clears\nthe table of new "
+           "loaded/reloaded modules to blank."),
     METHOD("raise_exception", raise_exception,
            "Raise given exception in the thread at the next opportunity"),
     METHOD("is_internal_frame", _tracer_is_internal_frame,
