@@ -225,3 +225,30 @@ def test_bootstrap_frame_in_any_file_ending_in_threading_py(tmp_path):
     assert_stops(run.stops, [("exception", "<string>", 15, "target", "ValueError", "?",
                               "target")])
     assert run.stdout == "raw thread done\n"
+
+
+def test_stop_trace_clears_the_trace_function_of_other_threads(tmp_path):
+    # A thread that sits in C when tracing stops must not keep the core's trace function
+    # until its next event: stop_trace clears it, so the thread's later events never reach
+    # the core (which would say so on the debug channel).
+    program = """
+        import sys
+        import threading
+        import _scripted_shared as shared
+
+        shared.release = threading.Event()
+        shared.seen = []
+
+        def sit():
+            shared.release.wait(30)
+            shared.seen.append(sys.gettrace())
+
+        shared.thread = threading.Thread(target=sit, name="sitter")
+        shared.thread.start()
+    """
+    log = tmp_path / "debug.txt"
+    run = ok(run_traced(tmp_path, program, first="continue_run", debug_file=str(log),
+                        after_stop="[shared.release.set(), shared.thread.join(), "
+                                   "repr(shared.seen)][2]"))
+    assert run.after_stop == "[None]"
+    assert "trace_dispatch called while not tracing" not in log.read_text()

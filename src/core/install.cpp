@@ -152,18 +152,38 @@ void install_tracer(PyInterpreterState* interp) {
   }
 }
 
+namespace {
+// Where the interpreter cannot clear one other thread's trace function (3.13), it can clear
+// every thread's at once: done when every thread that has one has ours, so that no foreign
+// tracer is touched.
+void clear_remaining_trace_functions(PyInterpreterState* interp) {
+  bool ours_left = false;
+  for (PyThreadState* ts : thread_states(interp)) {
+    Py_tracefunc func = compat::tstate_tracefunc(ts);
+    if (func != nullptr && func != c_dispatch) return;
+    if (func == c_dispatch && ts != compat::current_tstate()) ours_left = true;
+  }
+  if (!ours_left || !compat::set_trace_all_threads(nullptr, nullptr)) return;
+  for (PyThreadState* ts : thread_states(interp)) {
+    ThreadData* data = find_thread_data(&gSelf.thread_table, ts);
+    if (data != nullptr) data->global_trace_set = 0;
+  }
+}
+}  // namespace
+
 void remove_tracer(PyInterpreterState* interp) {
   for (PyThreadState* ts : thread_states(interp)) {
     if (!thread_state_alive(interp, ts)) continue;
     remove_tracer_from_frames(ts);
     ThreadData* data = find_thread_data(&gSelf.thread_table, ts);
-    // Other threads drop our C trace function now where the interpreter lets us; elsewhere
-    // their next event finds tracing stopped and removes it.
+    // Other threads drop our C trace function now where the interpreter lets us.
     if (data != nullptr && ts != compat::current_tstate() &&
         compat::tstate_tracefunc(ts) == c_dispatch) {
       set_thread_trace(ts, data, false);
     }
   }
+  clear_remaining_trace_functions(interp);
+  // A thread still holding it finds tracing stopped at its next event and removes it.
 }
 
 void install_start_thread_hooks(int flag) {
