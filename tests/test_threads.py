@@ -234,6 +234,7 @@ def test_stop_trace_clears_the_trace_function_of_other_threads(tmp_path):
     program = """
         import sys
         import threading
+        import time
         import _scripted_shared as shared
 
         shared.release = threading.Event()
@@ -245,6 +246,14 @@ def test_stop_trace_clears_the_trace_function_of_other_threads(tmp_path):
 
         shared.thread = threading.Thread(target=sit, name="sitter")
         shared.thread.start()
+        # Tracing stops only once the sitter waits inside Condition.wait, in C.
+        while True:
+            frame = sys._current_frames().get(shared.thread.ident)
+            if frame is not None and frame.f_code.co_name == "wait" and \
+                    frame.f_back is not None and frame.f_back.f_code.co_name == "wait":
+                break
+            time.sleep(0.001)
+        time.sleep(0.05)
     """
     log = tmp_path / "debug.txt"
     run = ok(run_traced(tmp_path, program, first="continue_run", debug_file=str(log),
