@@ -148,7 +148,7 @@ class Server:
             record.append(core.get_curr_frame(tid) is frame)
         if "probe" in self.config:
             names = {"core": core, "frame": frame, "shared": shared, "server": self,
-                     "threading": threading, "outermost": outermost}
+                     "threading": threading, "outermost": outermost, "sys": sys}
             record.append(eval(self.config["probe"], names))
         label = self.thread_label()
         if label in self.wait_in:

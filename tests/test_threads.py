@@ -83,17 +83,21 @@ SEQUENTIAL = """
 def test_threads_started_one_after_another(tmp_path):
     # Thread states are reused by the interpreter for later threads: each new thread must
     # get a fresh record (its own name, stepping state and bottom frame).
+    # The probe also asks is_botframe about the main thread's bottom frame: it answers for
+    # the calling thread only, so 0.
     config = dict(THREADED, default="step_into",
                   probe="[core.get_thread_name(core.get_current_tstate_id()),"
-                        " core.is_botframe(outermost(frame))]")
+                        " core.is_botframe(outermost(frame)),"
+                        " core.is_botframe(outermost(sys._current_frames()"
+                        "[threading.main_thread().ident]))]")
     run = ok(run_traced(tmp_path, SEQUENTIAL, **config))
     expected = []
     for n in range(3):
         expected += [
-            ("exception", "prog.py", 5, "work", "KeyError", f"w{n}", ["run", 1]),
-            ("line", "prog.py", 6, "work", f"w{n}", ["run", 1]),
-            ("line", "prog.py", 7, "work", f"w{n}", ["run", 1]),
-            ("return", "prog.py", 7, "work", n, f"w{n}", ["run", 1]),
+            ("exception", "prog.py", 5, "work", "KeyError", f"w{n}", ["run", 1, 0]),
+            ("line", "prog.py", 6, "work", f"w{n}", ["run", 1, 0]),
+            ("line", "prog.py", 7, "work", f"w{n}", ["run", 1, 0]),
+            ("return", "prog.py", 7, "work", n, f"w{n}", ["run", 1, 0]),
         ]
     assert_stops([s for s in run.stops if s[-2] != "main"], expected)
     # Each worker left its record when it ended: only the main thread is still known.
