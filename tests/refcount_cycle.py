@@ -59,17 +59,18 @@ def cycle():
 def main(cycles):
     core.init(0.0, 1, hooks, lambda: None, line_cb, return_cb, exception_cb, lambda: None, None,
               __import__, None, {})
-    # Untraced runs first: the interpreter and threading fill their own caches during the
-    # first two uses (measured: +5 references from the first run to the second, traced or
-    # not), which is not the core's doing.
-    scenario()
+    # An untraced run first: the interpreter and threading fill their own caches on first
+    # use, which is not the core's doing.
     scenario()
     gc.collect()
-    for _ in range(cycles):
+    totals = [0] * cycles  # made before measuring; printing waits until the end
+    for i in range(cycles):
         cycle()
         stops.clear()
         gc.collect()
-        print(sys.gettotalrefcount())
+        totals[i] = sys.gettotalrefcount()
+    for total in totals:
+        print(total)
     print("threads", len(core.get_threads()))
 
 
