@@ -36,10 +36,10 @@ ensure_machine_packages() {
 }
 
 # Makes (once) the virtual environment for an interpreter, with the build and test tools.
-ensure_venv() {  # name -> path of the venv's python
+ensure_venv() {  # name -> path of the venv's python (in $SELVANE_VENVS if set now)
   local name="$1" python venv
   python="$(python_for "$name")"
-  venv="$VENVS/$name"
+  venv="${SELVANE_VENVS:-$VENVS}/$name"
   if [ ! -x "$venv/bin/python" ]; then
     "$python" -m venv "$venv" >&2
   fi

@@ -15,19 +15,14 @@
 
 namespace {
 
-PyObject* f_trace_name() {
-  static PyObject* name = PyUnicode_InternFromString("f_trace");
-  return name;
-}
-
 Ref get_f_trace(PyObject* frame) {
-  Ref value = Ref::steal(PyObject_GetAttr(frame, f_trace_name()));
+  Ref value = compat::frame_get_trace(frame);
   if (!value) PyErr_Clear();
   return value;
 }
 
 void set_f_trace(PyObject* frame, PyObject* value) {
-  if (PyObject_SetAttr(frame, f_trace_name(), value) != 0) {
+  if (compat::frame_set_trace(frame, value) != 0) {
     DLOGEXCEPTION();
     PyErr_Clear();
   }
