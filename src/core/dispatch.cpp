@@ -112,8 +112,12 @@ void give_frame_f_trace(PyThreadState* ts, PyFrameObject* frame) {
 int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int what, PyObject* arg) {
   bool stopped = false;
   bool propagate = false;
+  uint64_t generation = thread_table_generation();
   if (!ensure_tracer_status_for(ts, data)) {
     do_dprintf(kDbgFlow, "TRACER STOPPED WHILE WAITING FOR MUTEX\n");
+  } else if (generation != thread_table_generation() &&
+             (data = find_thread_data(&gSelf.thread_table, ts)) == nullptr) {
+    // Installing ran code that reset the core: this event has nothing left to decide.
   } else {
     ++gSelf.instruction_count;
     if (gSelf.idle_period > 0 && do_idle() != 0) {

@@ -42,35 +42,43 @@ void set_stepping(ThreadData* data, Ref stop_frame, Ref step_out_frame, int firs
   data->line_range_end = last;
 }
 
-}  // namespace
-
-int __tracer_stop_here(PyObject* frame, int event) {
+// Nothing stops while the import callback runs or once tracing has stopped, whatever the
+// thread's stepping state.
+bool stops_suspended() {
   if (gSelf.in_import_cb) {
     do_dprintf(kDbgFlow, "Not stopping here because import callback is active\n");
-    return 0;
+    return true;
   }
   if (!gSelf.trace_started) {
     do_dprintf(kDbgFlow, "Not stopping here because no longer tracing\n");
-    return 0;
+    return true;
   }
+  return false;
+}
+
+int decide_stop(ThreadData* data, PyObject* frame, int event);
+
+}  // namespace
+
+int __tracer_stop_here(PyObject* frame, int event) {
+  if (stops_suspended()) return 0;
   ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
   if (data == nullptr) {
     PyErr_Clear();
     do_dprintf(kDbgFlow, "ERROR: UNEXPECTED thread_data == NULL (while still tracing)!\n");
     return 0;
   }
-  return stop_here_for(data, frame, event);
+  return decide_stop(data, frame, event);
 }
 
 int stop_here_for(ThreadData* data, PyObject* frame, int event) {
-  if (gSelf.in_import_cb) {
-    do_dprintf(kDbgFlow, "Not stopping here because import callback is active\n");
-    return 0;
-  }
-  if (!gSelf.trace_started) {
-    do_dprintf(kDbgFlow, "Not stopping here because no longer tracing\n");
-    return 0;
-  }
+  return stops_suspended() ? 0 : decide_stop(data, frame, event);
+}
+
+namespace {
+
+// The thread's stepping state decides (the sub-language hook, once there is one, first).
+int decide_stop(ThreadData* data, PyObject* frame, int event) {
   if (!data->stop_frame) {
     do_dprintf(kDbgFlow, "Not stopping here because stop_frame == NULL\n");
     return 0;
@@ -96,6 +104,8 @@ int stop_here_for(ThreadData* data, PyObject* frame, int event) {
   }
   return 0;
 }
+
+}  // namespace
 
 void __tracer_step_into(ThreadData* data) {
   set_stepping(data, Ref::none(), Ref::none(), -1, -1);
