@@ -3,6 +3,8 @@
 // locals back into a frame.
 #include <Python.h>
 
+#include <climits>
+
 #include "core/tracercore.h"
 #include "module/methods.h"
 #include "names/conames.h"
@@ -56,7 +58,15 @@ PyObject* get_thread_ident_for_tstate_id(PyObject*, PyObject* args) {
 PyObject* add_to_tstate_tracing(PyObject*, PyObject* args) {
   int delta = 0;
   if (!PyArg_ParseTuple(args, "i:add_to_tstate_tracing", &delta)) return nullptr;
-  compat::tracing_add(compat::current_tstate(), delta);
+  PyThreadState* ts = compat::current_tstate();
+  // A negative counter breaks the interpreter's own bookkeeping of trace calls (a debug
+  // build aborts on it): the value may be negative, the counter may not become so.
+  long result = static_cast<long>(compat::tracing_get(ts)) + delta;
+  if (result < 0 || result > INT_MAX / 2) {
+    PyErr_Format(PyExc_ValueError, "tracing counter would become %ld", result);
+    return nullptr;
+  }
+  compat::tracing_add(ts, delta);
   Py_RETURN_NONE;
 }
 

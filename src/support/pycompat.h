@@ -109,8 +109,15 @@ inline bool use_tracing_is_off(PyThreadState* ts) {
 inline int tracing_get(PyThreadState* ts) noexcept {
   return ts->tracing - (detail::use_tracing_is_off(ts) ? 1 : 0);
 }
+// Adds to the counter. 3.11 also keeps `cframe->use_tracing` equal to "tracing is 0 and a
+// trace or profile function is set" and asserts it in debug builds; it is recomputed here by
+// the interpreter's own rule. Later versions have no such flag.
 inline void tracing_add(PyThreadState* ts, int delta) noexcept {
   ts->tracing += delta;
+#if PY_VERSION_HEX < 0x030C0000
+  bool use = ts->tracing == 0 && tstate_has_trace_or_profile(ts);
+  ts->cframe->use_tracing = use ? 255 : 0;
+#endif
 }
 
 // 1 when trace and profile functions would be called in this thread now, else 0.
