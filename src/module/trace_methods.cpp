@@ -32,9 +32,7 @@ PyObject* run_step_command(StepCommand command) {
   command(data);
   Py_RETURN_NONE;
 }
-}  // namespace
 
-namespace {
 // Tracing needs what init stores (the trace function object, the callbacks); before init
 // the methods that would start it refuse instead of tracing with null fields.
 bool initialised(const char* method) {
