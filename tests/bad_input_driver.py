@@ -10,10 +10,7 @@ import sys
 import threading
 
 import tvantrel30pydebugstackless as core
-
-
-def noop(*args):
-    return None
+from core_args import init_args, noop
 
 
 def kinds():
@@ -28,12 +25,6 @@ def kinds():
     ]
 
 
-def init_args(**overrides):
-    args = dict(idle_period=0.0, exception_mode=0, install_thread_hooks_cb=noop, idle_cb=noop,
-                line_cb=noop, return_cb=noop, exception_cb=noop, quit_cb=noop, import_cb=None,
-                default_import=__import__, dprintf_file=None, internal_modules_map={})
-    args.update(overrides)
-    return list(args.values())
 
 
 def storm():

@@ -9,22 +9,11 @@ import threading
 import pytest
 
 import tvantrel30pydebugstackless as core
-
-
-def noop(*args):
-    return None
+from core_args import init_args, noop
 
 
 class Collector(io.StringIO):
     """A debug file that remembers what the core wrote."""
-
-
-def init_args(**overrides):
-    args = dict(idle_period=0.0, exception_mode=0, install_thread_hooks_cb=noop, idle_cb=noop,
-                line_cb=noop, return_cb=noop, exception_cb=noop, quit_cb=noop, import_cb=None,
-                default_import=__import__, dprintf_file=None, internal_modules_map={})
-    args.update(overrides)
-    return list(args.values())
 
 
 @pytest.fixture(autouse=True)
