@@ -7,6 +7,8 @@
 // pending exception as one object on every interpreter.
 #pragma once
 
+#include "common/debug_capture.h"
+
 #include <Python.h>
 #include <frameobject.h>
 #include <gtest/gtest.h>
@@ -69,22 +71,7 @@ class TraceCounter {
   int watched_events_ = 0;
 };
 
-// Sends the debug print channel into an io.StringIO for its scope, with the given mask;
-// restores the file (none) and the mask at the end.
-class DebugCapture {
- public:
-  explicit DebugCapture(unsigned int mask);
-  ~DebugCapture();
-  DebugCapture(const DebugCapture&) = delete;
-  DebugCapture& operator=(const DebugCapture&) = delete;
-
-  std::string text() const;
-  PyObject* file() const { return buffer_.get(); }
-
- private:
-  Ref buffer_;
-  unsigned int saved_mask_;
-};
+using nativetest::DebugCapture;
 
 // Every test starts and ends with no Python error pending and no trace function installed.
 class PythonTest : public ::testing::Test {

@@ -7,6 +7,7 @@
 #include <cstring>
 
 #include "core/tracercore.h"
+#include "common/interpreter_main.h"
 #include "core_test_support.h"
 #include "support/dbgcommon.h"
 #include "threads/threadops.h"
@@ -120,27 +121,6 @@ int TraceCounter::trace(PyObject* obj, PyFrameObject* frame, int, PyObject*) {
   return 0;
 }
 
-DebugCapture::DebugCapture(unsigned int mask) : saved_mask_(gDPrintfMask) {
-  Ref io = Ref::steal(PyImport_ImportModule("io"));
-  EXPECT_TRUE(io);
-  buffer_ = io ? Ref::steal(PyObject_CallMethod(io.get(), "StringIO", nullptr)) : Ref();
-  EXPECT_TRUE(buffer_);
-  set_dprintf_file(buffer_.get());
-  gDPrintfMask = mask;
-}
-
-DebugCapture::~DebugCapture() {
-  set_dprintf_file(nullptr);
-  gDPrintfMask = saved_mask_;
-}
-
-std::string DebugCapture::text() const {
-  Ref value = Ref::steal(PyObject_CallMethod(buffer_.get(), "getvalue", nullptr));
-  const char* utf8 = value ? PyUnicode_AsUTF8(value.get()) : nullptr;
-  EXPECT_NE(utf8, nullptr);
-  return utf8 != nullptr ? utf8 : "";
-}
-
 void PythonTest::SetUp() {
   ASSERT_EQ(PyErr_Occurred(), nullptr);
   ASSERT_EQ(PyThreadState_Get()->c_tracefunc, nullptr);
@@ -161,23 +141,14 @@ void PythonTest::TearDown() {
 
 namespace {
 
-class PythonEnvironment : public ::testing::Environment {
- public:
-  void SetUp() override {
-    Py_InitializeEx(0);
-    // What loading the extension module does before any method can run.
-    gPtrTo_PyUnicode_FromString = PyUnicode_FromString;
-    gPtrTo_PyUnicode_FormatV = PyUnicode_FromFormatV;
-    init_threadops();
-    ASSERT_EQ(init_tracercore(), 0);
-  }
-  void TearDown() override { ASSERT_EQ(Py_FinalizeEx(), 0); }
-};
+// What loading the extension module does before any method can run, beyond the string makers.
+void prepare_core() {
+  init_threadops();
+  ASSERT_EQ(init_tracercore(), 0);
+}
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  ::testing::InitGoogleTest(&argc, argv);
-  ::testing::AddGlobalTestEnvironment(new PythonEnvironment);
-  return RUN_ALL_TESTS();
+  return nativetest::run_tests_with_interpreter(argc, argv, prepare_core);
 }

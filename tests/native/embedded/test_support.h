@@ -15,6 +15,7 @@
 #include <memory>
 #include <string>
 
+#include "common/debug_capture.h"
 #include "names/conames.h"
 #include "support/dprintf.h"
 #include "support/ref.h"
@@ -118,18 +119,10 @@ class ScopedClock {
   time_t (*saved_)();
 };
 
-// Sends debug messages of the path-name class into a StringIO for its scope.
-class DebugCapture {
+// Captures the debug channel with the path-name messages switched on.
+class DebugCapture : public nativetest::DebugCapture {
  public:
-  DebugCapture();
-  ~DebugCapture();
-  DebugCapture(const DebugCapture&) = delete;
-  DebugCapture& operator=(const DebugCapture&) = delete;
-  std::string text() const;
-
- private:
-  Ref buffer_;
-  unsigned int saved_mask_;
+  DebugCapture() : nativetest::DebugCapture(gDPrintfMask | kDbgPathnames) {}
 };
 
 // Every test runs with the interpreter up and leaves no Python error behind.
