@@ -69,7 +69,7 @@ int dispatch_by_event(ThreadData* data, PyFrameObject* frame, int what, PyObject
   int result = 0;
   switch (what) {
     case PyTrace_CALL:
-      result = dispatch_call_for(data, f);
+      result = dispatch_call(data, f);
       if (result == -2) {
         do_dprintf(kDbgFlow, "PROPAGATING EXCEPTION INTO USER CODE\n");
         *propagate = true;
@@ -85,11 +85,11 @@ int dispatch_by_event(ThreadData* data, PyFrameObject* frame, int what, PyObject
       if (result != 0) do_dprintf(kDbgFlow, "TRACER EXC STOPPED TRACER\n");
       return result != 0 ? -1 : 0;
     case PyTrace_LINE:
-      result = dispatch_line_for(data, f);
+      result = dispatch_line(data, f);
       if (result != 0) do_dprintf(kDbgFlow, "TRACER LINE STOPPED TRACER\n");
       return result != 0 ? -1 : 0;
     case PyTrace_RETURN:
-      result = dispatch_return_for(
+      result = dispatch_return(
           data, f, compat::return_value_of_event(data->last_exception_frame, frame, arg));
       if (result != 0) do_dprintf(kDbgFlow, "TRACER RETURN STOPPED TRACER\n");
       return result != 0 ? -1 : 0;
@@ -113,7 +113,7 @@ int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int wha
   bool stopped = false;
   bool propagate = false;
   uint64_t generation = thread_table_generation();
-  if (!ensure_tracer_status_for(ts, data)) {
+  if (!__ensure_tracer_status(ts, data)) {
     do_dprintf(kDbgFlow, "TRACER STOPPED WHILE WAITING FOR MUTEX\n");
   } else if (generation != thread_table_generation() &&
              (data = find_thread_data(&gSelf.thread_table, ts)) == nullptr) {
@@ -243,18 +243,7 @@ PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args) {
   return gSelf.trace_dispatch.new_ref();
 }
 
-int __ensure_tracer_status() {
-  PyThreadState* ts = compat::current_tstate();
-  ThreadData* data = thread_data_for(&gSelf.thread_table, ts);
-  if (data == nullptr) {
-    DLOGEXCEPTION();
-    PyErr_Clear();
-    return 0;
-  }
-  return ensure_tracer_status_for(ts, data);
-}
-
-int ensure_tracer_status_for(PyThreadState* ts, ThreadData* data) {
+int __ensure_tracer_status(PyThreadState* ts, ThreadData* data) {
   if (!gSelf.trace_started) {
     enter_debugger();
     do_dprintf(kDbgFlow, "trace_dispatch called while not tracing; thread = %ld\n",
@@ -311,16 +300,7 @@ int register_function_code(PyObject* frame) {
 
 }  // namespace
 
-int dispatch_call(PyObject* frame) {
-  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
-  if (data == nullptr) {
-    PyErr_Clear();
-    return 0;
-  }
-  return dispatch_call_for(data, frame);
-}
-
-int dispatch_call_for(ThreadData* data, PyObject* frame) {
+int dispatch_call(ThreadData* data, PyObject* frame) {
   if (!gSelf.trace_started) return -1;
   if (!compat::is_plain_frame(frame)) return 0;
   print_call(frame);
@@ -331,16 +311,7 @@ int dispatch_call_for(ThreadData* data, PyObject* frame) {
   return 0;
 }
 
-int dispatch_line(PyObject* frame) {
-  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
-  if (data == nullptr) {
-    PyErr_Clear();
-    return 0;
-  }
-  return dispatch_line_for(data, frame);
-}
-
-int dispatch_line_for(ThreadData* data, PyObject* frame) {
+int dispatch_line(ThreadData* data, PyObject* frame) {
   if (!gSelf.trace_started) return -1;
   if (!compat::is_plain_frame(frame)) return 0;
   if (dprintf_wanted(kDbgFlow)) {
@@ -389,16 +360,7 @@ void call_quit_cb_if_autoquit() {
   saved.restore();
 }
 
-int dispatch_return(PyObject* frame, PyObject* retval) {
-  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
-  if (data == nullptr) {
-    PyErr_Clear();
-    return 0;
-  }
-  return dispatch_return_for(data, frame, retval);
-}
-
-int dispatch_return_for(ThreadData* data, PyObject* frame, PyObject* retval) {
+int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
   if (!gSelf.trace_started) return -1;
   if (retval == nullptr) {
     if (dispatch_exception_return(frame, nullptr) != 0) return -1;

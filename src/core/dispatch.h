@@ -10,13 +10,15 @@
 int c_dispatch(PyObject* obj, PyFrameObject* frame, int what, PyObject* arg);
 PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args);
 
-// Per-event handlers: 0 to go on, -1 to stop tracing the thread, -2 (call only) to let an
-// exception propagate into the user's code.
-int dispatch_call(PyObject* frame);
-int dispatch_line(PyObject* frame);
-int dispatch_return(PyObject* frame, PyObject* retval);
+// Per-event handlers, for the calling thread's record: 0 to go on, -1 to stop tracing the
+// thread, -2 (call only) to let an exception propagate into the user's code. A handler that
+// runs Python code may lose the record (a callback can reset the core) and looks it up again.
+int dispatch_call(ThreadData* data, PyObject* frame);
+int dispatch_line(ThreadData* data, PyObject* frame);
+int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval);
 
-int __ensure_tracer_status();
+// 1 when the calling thread (`ts`, record `data`) may be traced, installing what it lacks.
+int __ensure_tracer_status(PyThreadState* ts, ThreadData* data);
 
 // The event a thread is dispatching, kept on the dispatcher's stack and reachable from the
 // thread's record: whether the thread holds the selvane mutex for it yet.
@@ -26,11 +28,6 @@ struct DispatchEvent {
   DispatchEvent* outer;  // an event this one interrupted, or null
 };
 
-// The handlers for a thread whose record the dispatcher already holds.
-int dispatch_call_for(ThreadData* data, PyObject* frame);
-int dispatch_line_for(ThreadData* data, PyObject* frame);
-int dispatch_return_for(ThreadData* data, PyObject* frame, PyObject* retval);
-int ensure_tracer_status_for(PyThreadState* ts, ThreadData* data);
 int do_callback(PyObject* cb, PyObject* frame, PyObject* arg);
 int do_idle();
 
