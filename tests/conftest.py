@@ -31,6 +31,7 @@ class Run:
     threads_after: int = -1
     tracing_after_stop: int = -1
     after_stop: object = None
+    stop_count: int = 0
 
 
 def write_program(tmp_path, source, name="prog.py"):
@@ -39,8 +40,9 @@ def write_program(tmp_path, source, name="prog.py"):
     return str(path)
 
 
-def run_traced(tmp_path, program, **config):
-    """Traces `program` (a path, or source text) under the scripted server side."""
+def run_traced(tmp_path, program, timeout=TIMEOUT, **config):
+    """Traces `program` (a path, or source text) under the scripted server side. A run that
+    takes longer than `timeout` seconds fails the test (a hang is a failure, not a stall)."""
     if "\n" in program:
         program = write_program(tmp_path, program)
     out = tmp_path / "stops.json"
@@ -49,8 +51,11 @@ def run_traced(tmp_path, program, **config):
     config = dict(config, program=program, out=str(out))
     config_path = tmp_path / "config.json"
     config_path.write_text(json.dumps(config))
-    proc = subprocess.run([sys.executable, SERVER, str(config_path)], capture_output=True,
-                          text=True, timeout=TIMEOUT, cwd=str(tmp_path))
+    try:
+        proc = subprocess.run([sys.executable, SERVER, str(config_path)], capture_output=True,
+                              text=True, timeout=timeout, cwd=str(tmp_path))
+    except subprocess.TimeoutExpired as hang:
+        pytest.fail(f"traced run did not end within {timeout} s:\n{hang.stderr}")
     run = Run(proc.returncode, proc.stdout, proc.stderr)
     if out.exists():
         data = json.loads(out.read_text())
@@ -59,6 +64,7 @@ def run_traced(tmp_path, program, **config):
         run.threads_after = data["threads_after"]
         run.tracing_after_stop = data["tracing_after_stop"]
         run.after_stop = data.get("after_stop")
+        run.stop_count = data.get("stop_count", 0)
     elif proc.returncode < 0 or "Fatal Python error" in proc.stderr:
         pytest.fail(f"traced run crashed ({proc.returncode}):\n{proc.stderr}")
     return run

@@ -14,8 +14,12 @@ Configuration keys:
                    list [name, args...] ("step_over_line_range", 3, 5); ["seq", c1, c2]
                    runs several commands in one stop; "raise" raises
                    RuntimeError from the callback; ["raise_exception", "ValueError", "msg"]
-                   injects an exception; "reset" resets the core from inside the callback
+                   injects an exception; "reset" resets the core from inside the callback;
+                   ["exec", source] runs Python source in the callback (names: core, shared,
+                   server, threading, frame)
   default          command used once the list is exhausted (default "continue_run")
+  cycle            commands used in turn, over and over, once the list is exhausted (instead
+                   of "default")
   first            command given before tracing starts (default "step_into")
   files            only stops in files whose base name is listed are recorded and consume
                    commands; stops elsewhere are answered with "when_elsewhere" (default:
@@ -25,8 +29,12 @@ Configuration keys:
                    server side itself runs while it starts tracing (the differential tests)
   debug_all_threads, autoquit, idle_period, exception_mode: run-control settings
   thread_policy    {"thread name": answer} for debug_thread_cb; unknown threads answer 1
+  thread_hook      the core's method that new threads start with (default
+                   "bootstrap_new_thread"; "trace_dispatch" skips the start hook)
+  thread_exiting   false: ending threads do not tell the core (default true)
   fail_in          "line", "return", "exception" or "idle": that callback raises once
   max_stops        stop recording (and answer continue_run) after this many stops
+  count_only       record no stops, only count them (written as "stop_count")
   probe            Python expression evaluated at each recorded stop (names: core, frame,
                    shared, server, threading); its value is appended to the record
   prelude          Python source run before tracing starts (names: core, shared, threading)
@@ -73,6 +81,8 @@ class Server:
         self.program = os.path.abspath(config["program"])
         self.commands = list(config.get("commands", []))
         self.default = config.get("default", "continue_run")
+        self.cycle = config.get("cycle", [])
+        self.cycle_index = 0
         self.when_elsewhere = config.get("when_elsewhere", "step_into")
         self.files = set(config.get("files", [os.path.basename(self.program)]))
         self.all_files = config.get("all_files", False)
@@ -80,11 +90,14 @@ class Server:
         self.max_stops = config.get("max_stops", 100000)
         self.fail_in = config.get("fail_in")
         self.stops = []
+        self.stop_count = 0
         self.events = []  # quit, idle and thread-hook calls, in order
         self.thread_names = {_MAIN_IDENT: "main"}
         self.wait_in = dict(config.get("wait_in", {}))
         policy = config.get("thread_policy")
         self.thread_policy = policy
+        self.frame = None  # the frame of the stop being answered
+        self.debug_file = None
 
     # ---- helpers ------------------------------------------------------------------------
 
@@ -105,6 +118,9 @@ class Server:
     def next_command(self):
         if self.commands:
             return self.commands.pop(0)
+        if self.cycle:
+            self.cycle_index += 1
+            return self.cycle[(self.cycle_index - 1) % len(self.cycle)]
         return self.default
 
     def run_command(self, command):
@@ -127,12 +143,36 @@ class Server:
         if name == "reset":
             core.reset()
             return
+        if name == "exec":
+            exec(args[0], {"core": core, "shared": shared, "server": self,
+                           "threading": threading, "frame": self.frame})
+            return
         getattr(core, name)(*args)
 
+    def init_core(self):
+        """Initialises the core with this server's callbacks (also from inside a callback)."""
+        core.init(float(self.config.get("idle_period", 0.0)),
+                  int(self.config.get("exception_mode", 0)), self.install_thread_hooks_cb,
+                  self.idle_cb, self.line_cb, self.return_cb, self.exception_cb, self.quit_cb,
+                  None, __import__, self.debug_file, {_SELF: 1})
+
     def stop(self, kind, frame, extra=_NOTHING):
+        # "exec" commands see the frame of this stop only: holding it longer would change
+        # when the program's objects die, and so which code runs traced.
+        self.frame = frame
+        try:
+            self.answer(kind, frame, extra)
+        finally:
+            self.frame = None
+
+    def answer(self, kind, frame, extra):
         if self.fail_in == kind:
             self.fail_in = None
             raise RuntimeError(f"{kind} callback failure")
+        if self.config.get("count_only"):
+            self.stop_count += 1
+            self.run_command(self.next_command())
+            return
         if not self.wanted(frame) or len(self.stops) >= self.max_stops:
             self.run_command(self.when_elsewhere if len(self.stops) < self.max_stops
                              else "continue_run")
@@ -182,7 +222,8 @@ class Server:
 
     def install_thread_hooks_cb(self, flag):
         self.events.append(["thread_hooks", flag])
-        threading.settrace(core.bootstrap_new_thread if flag else None)
+        hook = getattr(core, self.config.get("thread_hook", "bootstrap_new_thread"))
+        threading.settrace(hook if flag else None)
 
     def debug_thread_cb(self, identity):
         name = self.thread_names.get(identity, "?")
@@ -215,7 +256,8 @@ def _patch_thread_start(server):
         try:
             original(self)
         finally:
-            core.thread_exiting()
+            if server.config.get("thread_exiting", True):
+                core.thread_exiting()
 
     threading.Thread._bootstrap_inner = _bootstrap_inner
 
@@ -226,11 +268,8 @@ def main(config_path):
     server = Server(config)
     _patch_thread_start(server)
     shared.server = server
-    debug_file = open(config["debug_file"], "w") if "debug_file" in config else None
-    core.init(float(config.get("idle_period", 0.0)), int(config.get("exception_mode", 0)),
-              server.install_thread_hooks_cb, server.idle_cb, server.line_cb, server.return_cb,
-              server.exception_cb, server.quit_cb, None, __import__, debug_file,
-              {os.path.abspath(__file__): 1})
+    server.debug_file = open(config["debug_file"], "w") if "debug_file" in config else None
+    server.init_core()
     if "debug_all_threads" in config:
         core.set_debug_all_threads(int(config["debug_all_threads"]))
     if "autoquit" in config:
@@ -257,7 +296,7 @@ def main(config_path):
 
 def finish(server, config):
     core.stop_trace()
-    result = {"stops": server.stops, "events": server.events,
+    result = {"stops": server.stops, "stop_count": server.stop_count, "events": server.events,
               "threads_after": len(core.get_threads()), "tracing_after_stop": core.get_tracing()}
     if "after_stop" in config:
         names = {"core": core, "shared": shared, "sys": sys, "threading": threading}

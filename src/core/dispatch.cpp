@@ -52,12 +52,21 @@ bool debug_output_on() {
 void enter_for(ThreadData* data, DispatchEvent& event) {
   if (event.entered) return;
   event.entered = true;
+  event.tracing_at_entry = compat::tracing_get(compat::current_tstate());
   data->curr_frame = Ref::borrow(event.frame);
   acquire_selvane_mutex();
 }
 
 void leave_debugger(DispatchEvent& event) {
   if (!event.entered) return;
+  // The interpreter holds one unit of the thread's tracing counter while it calls us and
+  // takes it back when we return. A callback that lowered the counter without raising it
+  // again (add_to_tstate_tracing) would make it negative then, which switches tracing off
+  // for good or aborts a debug interpreter: the counter is put back here.
+  if (compat::tracing_repair(compat::current_tstate(), event.tracing_at_entry)) {
+    do_dprintf(kDbgFlow, "callback left the tracing counter below %d: restored\n",
+               event.tracing_at_entry);
+  }
   __tracer_clear_curr_frame();
   release_selvane_mutex();
   event.entered = false;
@@ -109,15 +118,13 @@ void give_frame_f_trace(PyThreadState* ts, PyFrameObject* frame) {
 }
 
 // Steps 8 to 11 of an event, once the thread may enter. Returns the trace function's result.
+// `data` is pinned by the caller: a reset while this thread waited or ran Python code has
+// renewed it in place, so it always describes the session in force now.
 int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int what, PyObject* arg) {
   bool stopped = false;
   bool propagate = false;
-  uint64_t generation = thread_table_generation();
   if (!__ensure_tracer_status(ts, data)) {
     do_dprintf(kDbgFlow, "TRACER STOPPED WHILE WAITING FOR MUTEX\n");
-  } else if (generation != thread_table_generation() &&
-             (data = find_thread_data(&gSelf.thread_table, ts)) == nullptr) {
-    // Installing ran code that reset the core: this event has nothing left to decide.
   } else {
     ++gSelf.instruction_count;
     if (gSelf.idle_period > 0 && do_idle() != 0) {
@@ -184,15 +191,15 @@ int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
     return 0;
   }
   compat::note_event(data->last_exception_frame, frame, what);
-  DispatchEvent event{reinterpret_cast<PyObject*>(frame), false, data->dispatch_event};
+  // Whatever happens to the core while this event waits or runs callbacks (another thread
+  // may reset or re-initialise it), the record stays valid until the event ends.
+  PinnedThreadData pin(data);
+  DispatchEvent event{reinterpret_cast<PyObject*>(frame), false, data->dispatch_event, 0};
   data->dispatch_event = &event;
-  uint64_t generation = thread_table_generation();
   // Another thread inside the debugger: wait for it here, before anything is decided.
   if (gSelf.selvane_mutex_owner != kNoMutexOwner || debug_output_on()) enter_for(data, event);
   int result = run_event(ts, data, frame, what, arg);
-  // The callbacks may have reset the core, taking the record with them.
-  if (generation != thread_table_generation()) data = find_thread_data(&gSelf.thread_table, ts);
-  if (data != nullptr && data->dispatch_event == &event) data->dispatch_event = event.outer;
+  if (data->dispatch_event == &event) data->dispatch_event = event.outer;
   leave_debugger(event);
   return result;
 }

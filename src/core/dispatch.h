@@ -26,6 +26,7 @@ struct DispatchEvent {
   PyObject* frame;       // borrowed for the duration of the event
   bool entered;          // the thread holds the mutex and its current frame is set
   DispatchEvent* outer;  // an event this one interrupted, or null
+  int tracing_at_entry;  // the thread's tracing counter when it entered the debugger
 };
 
 int do_callback(PyObject* cb, PyObject* frame, PyObject* arg);

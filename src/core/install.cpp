@@ -68,6 +68,7 @@ void name_thread(ThreadData* data, PyObject* frame) {
 // it did. On 3.13 a thread installs itself at its next event instead.
 bool set_thread_trace(PyThreadState* ts, ThreadData* data, bool on) {
   if (static_cast<bool>(data->global_trace_set) == on) return true;
+  PinnedThreadData pin(data);  // dropping the old trace object can run any code
   bool done = on ? compat::set_trace_for_thread(ts, c_dispatch, gSelf.trace_dispatch.get())
                  : compat::set_trace_for_thread(ts, nullptr, nullptr);
   if (PyErr_Occurred() != nullptr) {
@@ -100,6 +101,7 @@ void install_tracer_into_frames(PyThreadState* tstate) {
     PyErr_Clear();
     return;
   }
+  PinnedThreadData pin(data);  // replacing a frame's f_trace can run any code
   data->curr_frame = Ref::none();
   data->bot_frame = Ref::none();
   data->thread_name.reset();

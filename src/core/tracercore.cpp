@@ -57,6 +57,21 @@ Ref optional_attr(PyObject* obj, const char* name) {
   return value;
 }
 
+// A repeated init keeps the mutex and its owner, unlike a literal "allocate a new one":
+// threads already waiting on the old mutex would never wake, and an init made from a
+// callback would lose the release of the mutex its own thread holds (a deadlock seen with
+// init and start_trace from a line callback while a worker ran). Only a forked child whose
+// mutex is held by a thread that did not survive the fork gets a new one.
+void keep_or_make_thread_mutex(TracerState& s, bool forked_child) {
+  bool held_by_vanished_thread = forked_child && s.selvane_mutex_owner != kNoMutexOwner &&
+                                 s.selvane_mutex_owner != get_thread_ident();
+  if (s.thread_mutex != nullptr && !held_by_vanished_thread) return;
+  // Nobody in this process waits on a mutex whose holder vanished in the fork.
+  if (s.thread_mutex != nullptr) PyThread_free_lock(s.thread_mutex);
+  s.thread_mutex = allocate_thread_mutex();
+  s.selvane_mutex_owner = kNoMutexOwner;
+}
+
 void forget_run_control(TracerState& s) {
   s.autoquit = 1;
   s.debug_all_threads = 1;
@@ -93,11 +108,16 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
   store_callbacks(s, install_thread_hooks_cb, idle_cb, line_cb, return_cb, exception_cb, quit_cb,
                   import_cb, default_import, internal_modules_map);
 
-  if (s.thread_table.buckets != nullptr) clear_thread_table(&s.thread_table);
-  init_thread_table(&s.thread_table);
+  bool forked_child = s.pid != 0 && s.pid != getpid();
+  if (forked_child) drop_pins_of_vanished_threads(&s.thread_table, compat::current_tstate());
+  // Records of threads inside an event stay (renewed); the others go.
+  if (s.thread_table.buckets != nullptr) {
+    clear_thread_table(&s.thread_table);
+  } else {
+    init_thread_table(&s.thread_table);
+  }
   s.pending_exception_count = 0;  // the records that held them are gone
-  s.thread_mutex = allocate_thread_mutex();
-  s.selvane_mutex_owner = kNoMutexOwner;
+  keep_or_make_thread_mutex(s, forked_child);
 
   s.module = Ref::borrow(module);
   s.trace_dispatch = optional_attr(module, "trace_dispatch");
@@ -128,6 +148,8 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
   s.instruction_count = 0;
   s.import_hook_calls = 0;
   s.pid = getpid();
+  // A forked child that initialises starts a session of its own: it is traced again.
+  s.in_forked_child = 0;
   init_exc_data(&s.exc_data);
   return 1;
 }

@@ -97,6 +97,8 @@ PyObject* _tracer_bootstrap_new_thread(PyObject* self, PyObject* args) {
   // The interpreter reuses thread-state memory: a record under this pointer belongs to a
   // thread that has ended.
   __tracer_forget_thread(ts);
+  // So is the thread identity: an answer of the thread policy belongs to the earlier thread.
+  __clear_should_debug_thread_cache(get_thread_ident());
   install_tracer_into_frames(ts);
   set_global_trace_function(1);
   return _tracer_trace_dispatch(self, args);

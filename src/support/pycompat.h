@@ -120,6 +120,14 @@ inline void tracing_add(PyThreadState* ts, int delta) noexcept {
 #endif
 }
 
+// Raises the counter back to `floor` when code run meanwhile left it lower; true when it did.
+inline bool tracing_repair(PyThreadState* ts, int floor) noexcept {
+  int now = tracing_get(ts);
+  if (now >= floor) return false;
+  tracing_add(ts, floor - now);
+  return true;
+}
+
 // 1 when trace and profile functions would be called in this thread now, else 0.
 inline int use_tracing_get(PyThreadState* ts) noexcept {
   if (detail::use_tracing_is_off(ts)) return 0;

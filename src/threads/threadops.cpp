@@ -115,16 +115,55 @@ ThreadData* insert_thread_data(CU_HashTable* table, PyThreadState* tstate) {
   return data;
 }
 
+void renew_thread_data(ThreadData* data) {
+  // The record is consistent before any reference goes: dropping one can run finalizers
+  // that trace or ask the table about this thread.
+  Ref held[] = {std::move(data->bot_frame),         std::move(data->stop_frame),
+                std::move(data->step_out_frame),    std::move(data->thread_name),
+                std::move(data->sub_language_frame), std::move(data->sub_language_hook),
+                std::move(data->pending_exception)};
+  data->tracer_in_frames = 0;
+  data->global_trace_set = 0;
+  data->thread_name = Ref::none();
+  data->bot_frame = Ref::none();
+  data->step_out_frame = Ref::none();
+  data->line_range_start = -1;
+  data->line_range_end = -1;
+  data->leaving_bot_frame = 0;
+  data->last_exception_frame = nullptr;
+  ++gThreadTableGeneration;
+  for (Ref& ref : held) ref.reset();
+}
+
 void remove_thread_data(CU_HashTable* table, PyThreadState* tstate) {
   CU_HashEntry* entry = CU_FindHashEntry(table, &tstate);
   if (entry == nullptr) return;
   ThreadData* data = static_cast<ThreadData*>(CU_GetHashValue(entry));
+  if (data->pins > 0) {
+    renew_thread_data(data);
+    return;
+  }
   // Unlink before releasing: dropping a frame can run finalizers that trace or ask the
   // table about this thread, and they must not find a half-freed record.
   CU_DeleteHashEntry(entry);
   ++gThreadTableGeneration;
   free_thread_data(data);
 }
+
+namespace {
+// Puts a pinned record back into a cleared table. Without memory for the entry it is left
+// out of the table but not freed (its holders still use it): a bounded loss on a path that
+// only memory exhaustion takes.
+void keep_pinned(CU_HashTable* table, ThreadData* data) {
+  int is_new = 0;
+  CU_HashEntry* entry = CU_CreateHashEntry(table, &data->tstate, &is_new);
+  if (entry == nullptr) {
+    do_dprintf(kDbgFlow, "failure to keep a busy thread record\n");
+    return;
+  }
+  CU_SetHashValue(entry, data);
+}
+}  // namespace
 
 void clear_thread_table(CU_HashTable* table) {
   // Detach every record first, then release them, for the same reason as above.
@@ -141,7 +180,27 @@ void clear_thread_table(CU_HashTable* table) {
   CU_DeleteHashTable(table);
   init_thread_table(table);
   ++gThreadTableGeneration;
-  for (ThreadData* data : records) free_thread_data(data);
+  for (ThreadData* data : records) {
+    if (data->pins > 0) keep_pinned(table, data);
+  }
+  for (ThreadData* data : records) {
+    if (data->pins > 0) {
+      renew_thread_data(data);
+    } else {
+      free_thread_data(data);
+    }
+  }
+}
+
+void drop_pins_of_vanished_threads(CU_HashTable* table, PyThreadState* survivor) {
+  CU_HashSearch search;
+  for (CU_HashEntry* e = CU_FirstHashEntry(table, &search); e != nullptr;
+       e = CU_NextHashEntry(&search)) {
+    auto* data = static_cast<ThreadData*>(CU_GetHashValue(e));
+    if (data->tstate == survivor) continue;
+    data->pins = 0;
+    data->dispatch_event = nullptr;
+  }
 }
 
 ThreadData* get_current_thread_data(CU_HashTable* table) {
@@ -176,6 +235,3 @@ ThreadData* current_thread_data_or_insert(CU_HashTable* table) {
   return thread_data_for(table, compat::current_tstate());
 }
 
-uint64_t thread_table_generation() {
-  return gThreadTableGeneration;
-}

@@ -5,6 +5,12 @@
 // pointer's bytes. The interpreter reuses thread-state memory for later threads, so a
 // record found by pointer may belong to an earlier thread until it is removed; the thread
 // start hook removes such a stale record first.
+//
+// Records are pinned while code holds them across anything that may run Python code or
+// wait for the selvane mutex: above all every event being dispatched, whose thread may wait
+// while another thread resets or re-initialises the core. A pinned record is never freed:
+// removing it (reset, init, a thread's exit) gives it the state of a new record in place, so
+// a pointer held by a waiting thread stays valid and sees the fresh session.
 #pragma once
 
 #include <Python.h>
@@ -38,6 +44,24 @@ struct ThreadData {
   // Borrowed, only compared: the frame of the thread's latest event if that was an
   // exception event (tells a frame left by an exception where the interpreter does not).
   PyFrameObject* last_exception_frame = nullptr;
+  // How many holders pin this record (see above); only the pinning code changes it.
+  int32_t pins = 0;
+};
+
+// Pins a record for the life of the object (null is allowed and pins nothing).
+class PinnedThreadData {
+ public:
+  explicit PinnedThreadData(ThreadData* data) noexcept : data_(data) {
+    if (data_ != nullptr) ++data_->pins;
+  }
+  ~PinnedThreadData() {
+    if (data_ != nullptr) --data_->pins;
+  }
+  PinnedThreadData(const PinnedThreadData&) = delete;
+  PinnedThreadData& operator=(const PinnedThreadData&) = delete;
+
+ private:
+  ThreadData* data_;
 };
 
 // The record of the calling thread, created when missing (null with MemoryError set when it
@@ -46,9 +70,6 @@ struct ThreadData {
 ThreadData* current_thread_data_or_insert(CU_HashTable* table);
 // The same for a given thread state (the dispatcher already has the calling thread's).
 ThreadData* thread_data_for(CU_HashTable* table, PyThreadState* tstate);
-// Changes whenever a record leaves a table: a record pointer taken under the same value is
-// still valid.
-uint64_t thread_table_generation();
 
 // The interpreter's thread-identity function, found at load, or null.
 extern unsigned long (*gGetThreadIdentFunc)(void);
@@ -66,8 +87,15 @@ void free_thread_data(ThreadData* data);
 void init_thread_table(CU_HashTable* table);
 ThreadData* insert_thread_data(CU_HashTable* table, PyThreadState* tstate);
 ThreadData* find_thread_data(CU_HashTable* table, PyThreadState* tstate);
+// Both free unpinned records and renew pinned ones in place (they stay in the table).
 void remove_thread_data(CU_HashTable* table, PyThreadState* tstate);
 void clear_thread_table(CU_HashTable* table);
+// Gives a record the state of a new one, keeping what ties it to its thread and to the
+// events in flight (thread state, identity, current frame, dispatch event, pins).
+void renew_thread_data(ThreadData* data);
+// In a forked child only the forking thread exists: the events that other threads had in
+// flight will never end, so their pins are dropped and their records can go.
+void drop_pins_of_vanished_threads(CU_HashTable* table, PyThreadState* survivor);
 ThreadData* get_current_thread_data(CU_HashTable* table);
 
 // Thread ids seen by Python code are the thread-state pointers as ints; they round-trip.
