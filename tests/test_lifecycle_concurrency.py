@@ -73,7 +73,9 @@ def run_waiting_worker(tmp_path, action):
     "core.reset()\ncore.start_trace()\n",
     "server.init_core()\ncore.start_trace()\n",
     "core.reset()\nserver.init_core()\ncore.start_trace()\n",
-], ids=["reset", "init", "reset-init"])
+    "core.stop_trace()\ncore.start_trace()\n",
+    "core.destroy()\nserver.init_core()\ncore.start_trace()\n",
+], ids=["reset", "init", "reset-init", "stop-start", "destroy-init"])
 def test_lifecycle_call_in_a_callback_while_another_thread_waits(tmp_path, action):
     run = run_waiting_worker(tmp_path, action)
     assert run.stdout == "waited: True worker: True\n"

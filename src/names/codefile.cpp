@@ -5,7 +5,6 @@
 // compiled file's recorded source; the module's __file__ is preferred then. Frames are
 // answered from the pathname table first: a hit costs one index probe and no allocation, as
 // this runs on every line event that needs a file name.
-#include <unistd.h>
 
 #include <cctype>
 #include <cstdlib>
@@ -29,27 +28,28 @@ bool ends_in_compiled_suffix_char(const char* name) {
 }
 
 // Same modification second and same size: the compiled file `globals_file` was made from a
-// copy of `co_filename`.
-bool same_mtime_and_size(const char* globals_file, const char* co_filename) {
+// copy of `co_filename`. Both stats come from the cache, like every stat of file names.
+bool same_mtime_and_size(FileOpsData* file_ops, const char* globals_file, const char* co_filename) {
   // A heap copy: this runs in trace functions, whose threads may have small stacks.
   char* source = strdup(globals_file);
   if (source == nullptr) return false;
   prune_py_c_or_o(source);
-  struct stat source_stat;
-  struct stat code_stat;
-  const bool same = stat(source, &source_stat) == 0 && stat(co_filename, &code_stat) == 0 &&
-                    source_stat.st_mtime == code_stat.st_mtime &&
-                    source_stat.st_size == code_stat.st_size;
+  const struct stat* source_stat = __tracer_stat(file_ops, source);
+  const struct stat* code_stat = __tracer_stat(file_ops, co_filename);
+  const bool same = source_stat != nullptr && code_stat != nullptr &&
+                    source_stat->st_mtime == code_stat->st_mtime &&
+                    source_stat->st_size == code_stat->st_size;
   std::free(source);
   return same;
 }
 
 // __file__ is a compiled file whose source is the same file as co_filename under another
 // directory (a tree that was copied or moved after compiling).
-bool globals_file_is_compiled_copy(const char* globals_file, const char* co_filename) {
+bool globals_file_is_compiled_copy(FileOpsData* file_ops, const char* globals_file,
+                                   const char* co_filename) {
   return std::strlen(globals_file) < kMaxPathLen && ends_in_compiled_suffix_char(globals_file) &&
          py_names_equiv(find_basename(globals_file), find_basename(co_filename)) &&
-         same_mtime_and_size(globals_file, co_filename);
+         same_mtime_and_size(file_ops, globals_file, co_filename);
 }
 
 // The text of globals["__file__"] when it is exactly a str, else null (no error pending).
@@ -71,12 +71,16 @@ bool is_pseudo_file_name(const char* name) {
 
 }  // namespace
 
-int use_globals_name(const char* globals_file, const char* co_filename) {
+int use_globals_name(FileOpsData* file_ops, const char* globals_file, const char* co_filename) {
   if (globals_file == nullptr) return 0;
   if (co_filename == nullptr) return 1;
   if (py_names_equiv(globals_file, co_filename)) return 0;
-  if (access(co_filename, R_OK) != 0) return 1;
-  return globals_file_is_compiled_copy(globals_file, co_filename) ? 1 : 0;
+  // "Cannot be read" is asked of the stat cache: a file that cannot be statted cannot be
+  // read, and a failed stat is remembered briefly, so a module whose co_filename is stale
+  // costs no system call per lookup. (A file that exists but denies reading counts as
+  // readable here; the interpreter could not have compiled it from there either way.)
+  if (__tracer_stat(file_ops, co_filename) == nullptr) return 1;
+  return globals_file_is_compiled_copy(file_ops, globals_file, co_filename) ? 1 : 0;
 }
 
 const char* find_codefile(COPathnameTable* table, PyObject* globals, PyObject* co_filename) {
@@ -86,7 +90,7 @@ const char* find_codefile(COPathnameTable* table, PyObject* globals, PyObject* c
                               : nullptr;
   // Code compiled from a string stays "<string>", whatever module it runs in.
   if (code_file != nullptr && std::strcmp(code_file, "<string>") == 0) return code_file;
-  if (use_globals_name(globals_file, code_file)) return globals_file;
+  if (use_globals_name(table->file_ops, globals_file, code_file)) return globals_file;
   if (code_file == nullptr) return "<string>";
   return code_file;
 }

@@ -64,8 +64,9 @@ int RegisterMatchingDictValues(RegisterMatchingContext* context, PyObject* dict,
 
 // ---- From code objects and frames to file names (codefile.cpp) ---------------------------
 
-// 1 when the module's `__file__` should be preferred to the code's `co_filename`.
-int use_globals_name(const char* globals_file, const char* co_filename);
+// 1 when the module's `__file__` should be preferred to the code's `co_filename`; the files
+// are statted through `file_ops`' cache.
+int use_globals_name(FileOpsData* file_ops, const char* globals_file, const char* co_filename);
 // The better of globals["__file__"] and co_filename; borrowed from those objects.
 const char* find_codefile(COPathnameTable* table, PyObject* globals, PyObject* co_filename);
 // The code's file name as found, in the table's path_buffer (valid until the next call).

@@ -118,8 +118,8 @@ ThreadData* insert_thread_data(CU_HashTable* table, PyThreadState* tstate) {
 void renew_thread_data(ThreadData* data) {
   // The record is consistent before any reference goes: dropping one can run finalizers
   // that trace or ask the table about this thread.
-  Ref held[] = {std::move(data->bot_frame),         std::move(data->stop_frame),
-                std::move(data->step_out_frame),    std::move(data->thread_name),
+  Ref held[] = {std::move(data->bot_frame),          std::move(data->stop_frame),
+                std::move(data->step_out_frame),     std::move(data->thread_name),
                 std::move(data->sub_language_frame), std::move(data->sub_language_hook),
                 std::move(data->pending_exception)};
   data->tracer_in_frames = 0;
@@ -234,4 +234,3 @@ ThreadData* thread_data_for(CU_HashTable* table, PyThreadState* tstate) {
 ThreadData* current_thread_data_or_insert(CU_HashTable* table) {
   return thread_data_for(table, compat::current_tstate());
 }
-

@@ -65,6 +65,28 @@ TEST_F(ThreadPolicyTest, ZeroAnswerIsCachedAndAskedOnce) {
   EXPECT_EQ(calls(), 2);
 }
 
+// Identities are reused by later threads; a refused thread is never traced, so nothing
+// clears its answer. The answer belongs to the thread state it was given for: another thread
+// state with the same identity is asked afresh.
+TEST_F(ThreadPolicyTest, AnswerGivenToAnEarlierThreadStateIsAskedAgain) {
+  use_callback("answer_zero");
+  EXPECT_EQ(__should_debug_thread(5), 0);
+  EXPECT_EQ(calls(), 1);
+  PyThreadState* later = PyThreadState_New(PyThreadState_Get()->interp);
+  ASSERT_NE(later, nullptr);
+  PyThreadState* mine = PyThreadState_Swap(later);
+  EXPECT_EQ(__should_debug_thread(5), 0);
+  EXPECT_EQ(__should_debug_thread(5), 0);
+  PyThreadState_Swap(mine);
+  EXPECT_EQ(calls(), 2);
+  EXPECT_EQ(gSelf.debug_thread_map.num_entries, 1u);
+  PyThreadState_Clear(later);
+  PyThreadState_Delete(later);
+  // Back in the first thread state, the entry now holds the later thread's answer.
+  EXPECT_EQ(__should_debug_thread(5), 0);
+  EXPECT_EQ(calls(), 3);
+}
+
 TEST_F(ThreadPolicyTest, CallbackGetsTheIdentityAsAnInt) {
   use_callback("answer_one");
   const unsigned long identity = 0xfedcba9876543210ul;

@@ -165,6 +165,74 @@ TEST_F(ThreadTableTest, RemovingReleasesTheRecordsReferencesAndOnlyThatRecord) {
   EXPECT_EQ(table_.num_entries, 1u);
 }
 
+// ---- pinned records -------------------------------------------------------------------------
+
+// A thread that waits inside an event holds its record: clearing the table (reset, init)
+// must not free it under the waiting thread, but give it the state of a new record.
+TEST_F(ThreadTableTest, ClearingRenewsAPinnedRecordInPlace) {
+  HeldObjects held, other;
+  ThreadData* data = insert_thread_data(&table_, PyThreadState_Get());
+  held.store_in(data);
+  data->line_range_start = 3;
+  data->line_range_end = 4;
+  data->tracer_in_frames = 1;
+  data->global_trace_set = 1;
+  other.store_in(insert_thread_data(&table_, new_state()));
+  {
+    PinnedThreadData pin(data);
+    clear_thread_table(&table_);
+    other.expect_released();
+    EXPECT_EQ(table_.num_entries, 1u);
+    ASSERT_EQ(get_current_thread_data(&table_), data);
+    EXPECT_EQ(data->pins, 1);
+    EXPECT_FALSE(data->stop_frame);
+    EXPECT_TRUE(data->bot_frame.is_none());
+    EXPECT_TRUE(data->step_out_frame.is_none());
+    EXPECT_TRUE(data->thread_name.is_none());
+    EXPECT_FALSE(data->pending_exception);
+    EXPECT_EQ(data->line_range_start, -1);
+    EXPECT_EQ(data->line_range_end, -1);
+    EXPECT_EQ(data->tracer_in_frames, 0);
+    EXPECT_EQ(data->global_trace_set, 0);
+    // The frame of the event in progress stays: it is still the thread's current frame.
+    EXPECT_TRUE(data->curr_frame.is(held.objects[4].get()));
+  }
+  EXPECT_EQ(data->pins, 0);
+  clear_thread_table(&table_);
+  held.expect_released();
+  EXPECT_EQ(table_.num_entries, 0u);
+}
+
+TEST_F(ThreadTableTest, RemovingAPinnedRecordRenewsItAndKeepsIt) {
+  HeldObjects held;
+  PyThreadState* ts = new_state();
+  ThreadData* data = insert_thread_data(&table_, ts);
+  held.store_in(data);
+  {
+    PinnedThreadData pin(data);
+    remove_thread_data(&table_, ts);
+    EXPECT_EQ(find_thread_data(&table_, ts), data);
+    EXPECT_FALSE(data->stop_frame);
+  }
+  remove_thread_data(&table_, ts);
+  EXPECT_EQ(find_thread_data(&table_, ts), nullptr);
+  held.expect_released();
+}
+
+TEST_F(ThreadTableTest, PinsOfThreadsThatVanishedInAForkAreDropped) {
+  PyThreadState* gone = new_state();
+  ThreadData* vanished = insert_thread_data(&table_, gone);
+  ThreadData* mine = insert_thread_data(&table_, PyThreadState_Get());
+  ++vanished->pins;  // as if that thread had an event in flight when the process forked
+  PinnedThreadData pin(mine);
+  drop_pins_of_vanished_threads(&table_, PyThreadState_Get());
+  EXPECT_EQ(vanished->pins, 0);
+  EXPECT_EQ(mine->pins, 1);
+  clear_thread_table(&table_);
+  EXPECT_EQ(find_thread_data(&table_, gone), nullptr);
+  EXPECT_EQ(get_current_thread_data(&table_), mine);
+}
+
 // Makes the interpreter's raw allocator give the memory of one freed block to the next
 // request of the same size, as a plain malloc usually does with a freed thread state. Under
 // AddressSanitizer freed memory is quarantined and the interpreter would never hand out the

@@ -8,6 +8,7 @@
 #include <string>
 
 #include "core/exception_dispatch.h"
+#include "core/thread_policy.h"
 #include "tracer_fixture.h"
 
 namespace {
@@ -89,6 +90,22 @@ TEST_F(TracerCoreTest, InitStoresTheArguments) {
   EXPECT_EQ(debug_text().rfind("INIT CORE\n", 0), 0u) << debug_text();
 }
 
+// Threads may wait on the mutex, or the caller itself hold it (init from a callback): a
+// repeated init keeps both the mutex and its owner, so no waiter is lost and the holder's
+// release still works.
+TEST_F(TracerCoreTest, RepeatedInitKeepsTheMutexAndItsOwner) {
+  ASSERT_EQ(init(), 1);
+  PyThread_type_lock mutex = gSelf.thread_mutex;
+  ASSERT_EQ(acquire_selvane_mutex(), 1);
+  ASSERT_EQ(init(), 1);
+  EXPECT_EQ(gSelf.thread_mutex, mutex);
+  EXPECT_EQ(gSelf.selvane_mutex_owner, get_thread_ident());
+  release_selvane_mutex();
+  EXPECT_EQ(gSelf.selvane_mutex_owner, kNoMutexOwner);
+  EXPECT_EQ(PyThread_acquire_lock(mutex, NOWAIT_LOCK), 1) << "the mutex was left held";
+  PyThread_release_lock(mutex);
+}
+
 TEST_F(TracerCoreTest, InitRestoresTheDefaults) {
   gSelf.trace_started = 1;
   gSelf.in_idle = 1;
@@ -99,7 +116,6 @@ TEST_F(TracerCoreTest, InitRestoresTheDefaults) {
   gSelf.next_idle_time = 12345;
   gSelf.instruction_count = 50;
   gSelf.import_hook_calls = 9;
-  gSelf.selvane_mutex_owner = 77;
   gSelf.spare_ref = Ref::none();
   gSelf.always_stop_excepts = Ref::steal(PyTuple_New(0));
   gSelf.debug_thread_cb = Ref::borrow(cb("idle_cb"));
@@ -113,7 +129,6 @@ TEST_F(TracerCoreTest, InitRestoresTheDefaults) {
   EXPECT_EQ(gSelf.next_idle_time, 0);
   EXPECT_EQ(gSelf.instruction_count, 0u);
   EXPECT_EQ(gSelf.import_hook_calls, 0u);
-  EXPECT_EQ(gSelf.selvane_mutex_owner, kNoMutexOwner);
   EXPECT_NE(gSelf.thread_mutex, nullptr);
   EXPECT_FALSE(gSelf.spare_ref);
   EXPECT_FALSE(gSelf.always_stop_excepts);

@@ -8,6 +8,7 @@
 #include <cstring>
 #include <filesystem>
 #include <string>
+#include <vector>
 
 #include "test_support.h"
 
@@ -42,21 +43,39 @@ std::string text_or_null(const char* text) {
 
 // ---- use_globals_name ----------------------------------------------------------------------
 
-TEST(UseGlobalsName, MissingNames) {
-  EXPECT_EQ(use_globals_name(nullptr, "/x/m.py"), 0);
-  EXPECT_EQ(use_globals_name(nullptr, nullptr), 0);
-  EXPECT_EQ(use_globals_name("/x/m.py", nullptr), 1);
+// Each check asks a stat cache of its own unless it says otherwise.
+class UseGlobalsName : public ::testing::Test {
+ protected:
+  void TearDown() override {
+    for (FileOpsData* cache : caches_) destroy_file_ops_data(cache);
+  }
+  FileOpsData* fresh_cache() {
+    caches_.push_back(create_file_ops_data());
+    return caches_.back();
+  }
+  int ask(const std::string& globals_file, const std::string& co_filename) {
+    return use_globals_name(fresh_cache(), globals_file.c_str(), co_filename.c_str());
+  }
+
+ private:
+  std::vector<FileOpsData*> caches_;
+};
+
+TEST_F(UseGlobalsName, MissingNames) {
+  EXPECT_EQ(use_globals_name(fresh_cache(), nullptr, "/x/m.py"), 0);
+  EXPECT_EQ(use_globals_name(fresh_cache(), nullptr, nullptr), 0);
+  EXPECT_EQ(use_globals_name(fresh_cache(), "/x/m.py", nullptr), 1);
 }
 
-TEST(UseGlobalsName, EquivalentNamesKeepCodeName) {
-  EXPECT_EQ(use_globals_name("/nowhere/m.pyc", "/nowhere/m.py"), 0);
+TEST_F(UseGlobalsName, EquivalentNamesKeepCodeName) {
+  EXPECT_EQ(ask("/nowhere/m.pyc", "/nowhere/m.py"), 0);
 }
 
-TEST(UseGlobalsName, UnreadableCodeNamePrefersGlobals) {
-  EXPECT_EQ(use_globals_name("/real/m.py", "/nonexistent/dir/m.py"), 1);
+TEST_F(UseGlobalsName, UnreadableCodeNamePrefersGlobals) {
+  EXPECT_EQ(ask("/real/m.py", "/nonexistent/dir/m.py"), 1);
 }
 
-TEST(UseGlobalsName, CompiledCopyOfCodeFilePrefersGlobals) {
+TEST_F(UseGlobalsName, CompiledCopyOfCodeFilePrefersGlobals) {
   TempDir temp;
   std::filesystem::create_directories(temp.file("build"));
   std::filesystem::create_directories(temp.file("src"));
@@ -66,15 +85,15 @@ TEST(UseGlobalsName, CompiledCopyOfCodeFilePrefersGlobals) {
   set_mtime(temp.file("src/m.py"), 1500000000);
   const std::string compiled = temp.file("build/m.pyc");
   const std::string code_file = temp.file("src/m.py");
-  EXPECT_EQ(use_globals_name(compiled.c_str(), code_file.c_str()), 1);
-  EXPECT_EQ(use_globals_name(temp.file("build/m.pyo").c_str(), code_file.c_str()), 1);
+  EXPECT_EQ(ask(compiled, code_file), 1);
+  EXPECT_EQ(ask(temp.file("build/m.pyo"), code_file), 1);
   // Not a compiled name: the readable co_filename stands.
-  EXPECT_EQ(use_globals_name(temp.file("build/m.py").c_str(), code_file.c_str()), 0);
+  EXPECT_EQ(ask(temp.file("build/m.py"), code_file), 0);
   set_mtime(temp.file("src/m.py"), 1500000001);
-  EXPECT_EQ(use_globals_name(compiled.c_str(), code_file.c_str()), 0);
+  EXPECT_EQ(ask(compiled, code_file), 0);
 }
 
-TEST(UseGlobalsName, DifferentSizeOrBasenameKeepsCodeName) {
+TEST_F(UseGlobalsName, DifferentSizeOrBasenameKeepsCodeName) {
   TempDir temp;
   std::filesystem::create_directories(temp.file("build"));
   write_file(temp.file("build/m.py"), "x = 1\n");
@@ -84,15 +103,40 @@ TEST(UseGlobalsName, DifferentSizeOrBasenameKeepsCodeName) {
   set_mtime(temp.file("other.py"), 1500000000);
   set_mtime(temp.file("m.py"), 1500000000);
   const std::string compiled = temp.file("build/m.pyc");
-  EXPECT_EQ(use_globals_name(compiled.c_str(), temp.file("other.py").c_str()), 0);
-  EXPECT_EQ(use_globals_name(compiled.c_str(), temp.file("m.py").c_str()), 0);
+  EXPECT_EQ(ask(compiled, temp.file("other.py")), 0);
+  EXPECT_EQ(ask(compiled, temp.file("m.py")), 0);
 }
 
-TEST(UseGlobalsName, OverlongGlobalsNameIsNotStatted) {
+TEST_F(UseGlobalsName, OverlongGlobalsNameIsNotStatted) {
   TempDir temp;
   write_file(temp.file("m.py"), "x = 1\n");
   const std::string overlong = "/" + std::string(kMaxPathLen, 'd') + "/m.pyc";
-  EXPECT_EQ(use_globals_name(overlong.c_str(), temp.file("m.py").c_str()), 0);
+  EXPECT_EQ(ask(overlong, temp.file("m.py")), 0);
+}
+
+// The answers come from the stat cache: what the files did after the first question is not
+// seen by the same cache (a missing file stays missing for a while, a stat stays as it was),
+// while a fresh cache sees it.
+TEST_F(UseGlobalsName, FileChecksGoThroughTheStatCache) {
+  TempDir temp;
+  std::filesystem::create_directories(temp.file("build"));
+  std::filesystem::create_directories(temp.file("src"));
+  const std::string compiled = temp.file("build/m.pyc");
+  const std::string code_file = temp.file("src/m.py");
+  FileOpsData* cache = fresh_cache();
+  EXPECT_EQ(use_globals_name(cache, compiled.c_str(), code_file.c_str()), 1);  // missing
+  write_file(temp.file("build/m.py"), "x = 1\n");
+  write_file(code_file, "y = 2\n");
+  set_mtime(temp.file("build/m.py"), 1500000000);
+  set_mtime(code_file, 1500000001);
+  EXPECT_EQ(use_globals_name(cache, compiled.c_str(), code_file.c_str()), 1);
+  EXPECT_EQ(ask(compiled, code_file), 0);  // exists, not the same file
+
+  FileOpsData* warm = fresh_cache();
+  EXPECT_EQ(use_globals_name(warm, compiled.c_str(), code_file.c_str()), 0);
+  set_mtime(code_file, 1500000000);  // now a copy of the compiled file's source
+  EXPECT_EQ(use_globals_name(warm, compiled.c_str(), code_file.c_str()), 0);
+  EXPECT_EQ(ask(compiled, code_file), 1);
 }
 
 // ---- find_codefile and the relative name ---------------------------------------------------
