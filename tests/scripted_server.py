@@ -73,6 +73,9 @@ shared.tids = {"main": core.get_current_tstate_id()}
 sys.modules["_scripted_shared"] = shared
 _SELF = os.path.abspath(__file__)
 _NOTHING = object()
+# The interpreter's own import function: init replaces the builtins' __import__ with the
+# core's hook, so a later init (from a callback, in a forked child) must not look it up again.
+_DEFAULT_IMPORT = builtins.__import__
 
 
 class Server:
@@ -154,7 +157,7 @@ class Server:
         core.init(float(self.config.get("idle_period", 0.0)),
                   int(self.config.get("exception_mode", 0)), self.install_thread_hooks_cb,
                   self.idle_cb, self.line_cb, self.return_cb, self.exception_cb, self.quit_cb,
-                  None, __import__, self.debug_file, {_SELF: 1})
+                  None, _DEFAULT_IMPORT, self.debug_file, {_SELF: 1})
 
     def stop(self, kind, frame, extra=_NOTHING):
         # "exec" commands see the frame of this stop only: holding it longer would change

@@ -109,10 +109,18 @@ def test_dprintf_file_of_any_type_is_accepted():
 # ---- debug output -------------------------------------------------------------------------
 
 
+# What init prints on the lifecycle channel: its banner, the installation of the import hook
+# into the builtins, and its end.
+INIT_MESSAGES = ("INIT CORE\n"
+                 "********************* INSTALLING TRACE HOOK ***********************\n"
+                 "********************* DONE INSTALLING TRACE HOOK ***********************\n"
+                 "DONE WITH INIT VANTREL\n")
+
+
 def test_init_and_destroy_messages():
     log = Collector()
     core.init(*init_args(dprintf_file=log))
-    assert log.getvalue() == "INIT CORE\nDONE WITH INIT VANTREL\n"
+    assert log.getvalue() == INIT_MESSAGES
     log.seek(0)
     log.truncate()
     core.destroy()
@@ -134,7 +142,7 @@ def test_reset_message():
     log = Collector()
     core.init(*init_args(dprintf_file=log))
     core.reset()
-    assert log.getvalue().startswith("INIT CORE\nDONE WITH INIT VANTREL\nRESET REACHED\n")
+    assert log.getvalue().startswith(INIT_MESSAGES + "RESET REACHED\n")
 
 
 def test_dprintf_none_releases_the_file_and_silences():

@@ -31,7 +31,8 @@ def noop(*args):
 
 
 MODULES = {}
-ARGS = (0.0, 0, noop, noop, noop, noop, noop, noop, None, __import__, None, MODULES)
+ORIGINAL_IMPORT = __import__  # kept before init replaces the builtins' one with the hook
+ARGS = (0.0, 0, noop, noop, noop, noop, noop, noop, None, ORIGINAL_IMPORT, None, MODULES)
 
 
 def total():
@@ -86,7 +87,7 @@ def test_repeated_init_grows_by_the_nine_overwritten_references():
 def test_rejected_init_leaks_nothing():
     def rejected():
         with pytest.raises(TypeError):
-            core.init(0.0, 0, noop, noop, noop, noop, noop, noop, 3, __import__, None, {})
+            core.init(0.0, 0, noop, noop, noop, noop, noop, noop, 3, ORIGINAL_IMPORT, None, {})
 
     assert growth(rejected) == 0
 
@@ -155,7 +156,8 @@ def test_callbacks_are_held_once_and_given_back_by_the_next_init():
         return None
 
     before = sys.getrefcount(line_cb)
-    core.init(0.0, 0, noop, noop, line_cb, noop, noop, noop, None, __import__, None, {})
+    core.init(0.0, 0, noop, noop, line_cb, noop, noop, noop, None, ORIGINAL_IMPORT, None,
+              {})
     assert sys.getrefcount(line_cb) == before + 1
     core.reset()  # reset keeps the callbacks
     assert sys.getrefcount(line_cb) == before + 1

@@ -1,20 +1,110 @@
-// bpops.h: breakpoint records, their tables and the changed-breakpoint lists.
+// bpops.h: breakpoint records, their table, the changed-breakpoint list, and the table of
+// loaded module files that breakpoints are matched against.
 //
-// The tables land with the breakpoint work; until then the record only counts the unique
-// imports that stop_trace reports, and its init and clear functions keep that count.
+// The breakpoint table is keyed by line number alone: a line event that finds no entry for
+// its line costs one integer lookup and nothing else. Each entry holds the chain of every
+// breakpoint on that line, of every file, newest first. Which file a breakpoint means is
+// settled by the loaded-module table (bpfiles.cpp): the user's spelling of a file name is
+// mapped to the canonical name of a loaded module's file, by file identity, never by text.
 #pragma once
 
 #include <Python.h>
 
+#include <cstdint>
+
+#include "names/fileops.h"
+#include "support/hashtable.h"
+#include "support/ref.h"
+
 struct COPathnameTable;
 
+struct Breakpoint {
+  int32_t id;                // unique, never reused within a session
+  char* user_filename;       // owned: the name as given to set_break; never null
+  char* module_filename;     // owned or null: canonical file once resolved
+  int32_t lineno;            // also the key of the breakpoint table
+  int16_t enabled;           // low 16 bits of what the user gave
+  int16_t temporary;         // deleted when it fires
+  char* cond;                // owned UTF-8 text, or null for no condition
+  int32_t ignore_count;      // further hits to ignore
+  int32_t hit_count;         // hits so far
+  int32_t deleted;           // fired as temporary; waits on the changed list
+  int32_t on_changed_list;   // 1 while on the changed list
+  Breakpoint* next_at_line;  // chain of the same line number
+  Breakpoint* next_changed;  // changed list
+};
+
 struct BpOpsData {
-  int unique_import_count = 0;  // modules registered by the import hook
+  CU_HashTable bp_table{};             // 4-byte line number -> head of the line's chain
+  Breakpoint* changed_head = nullptr;  // most recently changed first
+  int32_t next_id = 1;
+  CU_HashTable loaded_modules{};    // file name -> malloc'ed canonical module file name
+  FileOpsData* file_ops = nullptr;  // borrowed from the code-object table
+  COPathnameTable* co_pathname_table = nullptr;  // borrowed: frames to full file names
+  // Module files registered as new; reported by stop_trace, kept across resets.
+  int unique_import_count = 0;
+  char module_name_buffer[kMaxPathLen + 1] = {};
+  Ref file_key;  // owned: the str "__file__"
+  // Counts every record freed, for the life of the process: code that runs Python code in
+  // the middle of a walk over records (conditions) tells from it whether they still exist.
+  uint64_t free_count = 0;
 };
 
 void __tracer_init_bp_ops_data(BpOpsData* data, COPathnameTable* co_pathname_table);
 void __tracer_clear_bp_ops_data(BpOpsData* data, COPathnameTable* co_pathname_table);
 
+// ---- Records ------------------------------------------------------------------------------
+
+// New record, or null (no error set) when memory or the condition's conversion fails; the id
+// is used up either way. `cond` is None for no condition.
+Breakpoint* __tracer_create_bp(BpOpsData* data, const char* file, int lineno, int enabled,
+                               int temporary, PyObject* cond, int ignore_count);
+void __tracer_free_bp(Breakpoint* bp);
+int __tracer_add_userbp(BpOpsData* data, Breakpoint* bp);
+void __tracer_del_userbp(BpOpsData* data, Breakpoint* bp);
+// The chain of breakpoints on `lineno`, newest first, or null.
+Breakpoint* __tracer_bps_at_line(BpOpsData* data, int32_t lineno);
+
+// ---- The changed list -----------------------------------------------------------------------
+
+void __tracer_add_changed_bp(BpOpsData* data, Breakpoint* bp);
+void __tracer_remove_bp_from_changed(BpOpsData* data, Breakpoint* bp);
+void __tracer_clear_changed_bps(BpOpsData* data);
+// New 8-tuple describing `bp`; null with MemoryError set.
+PyObject* __tracer_python_bp_data(const Breakpoint* bp);
 // New 2-tuple (ids of deleted breakpoints, tuples of the other changed breakpoints); the
-// changed list is emptied. Null with MemoryError set when it cannot be made.
+// changed list is emptied. Null with MemoryError set when it cannot be made (the list is
+// then left as it was).
 PyObject* __tracer_get_changed_bps_lists(BpOpsData* data);
+
+// ---- The user's operations ----------------------------------------------------------------
+
+// The new id, or -1 with MemoryError set.
+int __tracer_set_break(BpOpsData* data, const char* file, int lineno, int enabled, int temporary,
+                       PyObject* cond, int ignore_count);
+void __tracer_clear_breaks(BpOpsData* data, const char* file, int lineno);
+int __tracer_enable_breaks(BpOpsData* data, const char* file, int lineno, int flag);
+int __tracer_ignore_breaks(BpOpsData* data, const char* file, int lineno, int count);
+// -1 with MemoryError set when the new condition cannot be stored.
+int __tracer_set_breaks_cond(BpOpsData* data, const char* file, int lineno, PyObject* cond);
+void __tracer_clear_all_breaks(BpOpsData* data);
+// New lists, or null with MemoryError set.
+PyObject* __tracer_get_breaks(BpOpsData* data, const char* file, int lineno);
+PyObject* __tracer_get_file_breaks(BpOpsData* data, const char* file);
+
+// ---- Loaded module files (bpfiles.cpp) ------------------------------------------------------
+
+// The canonical name now stored for `name` when it is the same file as `module_file`, else
+// null.
+const char* add_to_loaded_modules_if_samefile(BpOpsData* data, const char* name,
+                                              const char* module_file);
+// The canonical module file that `name` stands for, or null; a name found by file identity
+// is remembered as a further synonym.
+const char* __tracer_find_module(BpOpsData* data, const char* name);
+void __tracer_clear_loaded_modules(BpOpsData* data);
+// Gives a new breakpoint its module file when that is loaded. 0 with MemoryError set.
+int __tracer_find_bp_filename_synonyms(BpOpsData* data, Breakpoint* bp);
+// Registers a module file and gives waiting breakpoints their module file.
+void __tracer_resolve_bp_filenames(BpOpsData* data, const char* module_file);
+// The same for a module object, through its __file__.
+void __tracer_xfer_module_bps(BpOpsData* data, PyObject* module);

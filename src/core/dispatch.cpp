@@ -14,6 +14,7 @@
 
 #include "bp/breakhere.h"
 #include "core/exception_dispatch.h"
+#include "core/imports.h"
 #include "core/install.h"
 #include "core/stepping.h"
 #include "core/thread_policy.h"
@@ -313,6 +314,10 @@ int dispatch_call(ThreadData* data, PyObject* frame) {
   print_call(frame);
   if (!is_module_level(frame)) {
     if (register_function_code(frame) == -2) return -2;
+  } else {
+    // Module-level code: registering it can release code objects and run any code.
+    enter_debugger();
+    if (__tracer_top_level_call(frame) != 0) return -2;
   }
   if (data->bot_frame.is_none()) data->bot_frame = Ref::borrow(frame);
   return 0;

@@ -4,6 +4,7 @@
 
 #include <unistd.h>
 
+#include "core/imports.h"
 #include "core/install.h"
 #include "support/dprintf.h"
 #include "support/pycompat.h"
@@ -144,6 +145,10 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
   s.installed_import_hook.reset();
   s.in_import_cb = 0;
   s.import_hook_depth = 0;
+  __tracer_install_import_hook();
+  // A hook that cannot be installed (above all: the default import given is our own hook)
+  // fails init once the remaining fields are set.
+  bool hook_failed = PyErr_Occurred() != nullptr;
   __tracer_init_sub_language_state(&s.sub_language);
   s.instruction_count = 0;
   s.import_hook_calls = 0;
@@ -151,7 +156,7 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
   // A forked child that initialises starts a session of its own: it is traced again.
   s.in_forked_child = 0;
   init_exc_data(&s.exc_data);
-  return 1;
+  return hook_failed ? 0 : 1;
 }
 
 void __tracer_reset() {

@@ -54,5 +54,19 @@ PyObject* get_always_stop_excepts(PyObject* self, PyObject* args);
 PyObject* set_never_stop_excepts(PyObject* self, PyObject* args);
 PyObject* get_never_stop_excepts(PyObject* self, PyObject* args);
 
-// import_methods.cpp: the record of newly imported modules.
+// import_methods.cpp: newly imported modules, the import callback, the replacement __import__.
 PyObject* _tracer_get_new_imports(PyObject* self, PyObject* args);
+PyObject* _tracer_set_import_cb(PyObject* self, PyObject* args);
+PyObject* _tracer_register_module(PyObject* self, PyObject* args);
+PyObject* _tracer_import(PyObject* self, PyObject* args, PyObject* kwargs);
+
+// bp_methods.cpp: breakpoints.
+PyObject* _tracer_set_break(PyObject* self, PyObject* args);
+PyObject* _tracer_clear_breaks(PyObject* self, PyObject* args);
+PyObject* _tracer_enable_breaks(PyObject* self, PyObject* args);
+PyObject* _tracer_ignore_breaks(PyObject* self, PyObject* args);
+PyObject* _tracer_set_breaks_cond(PyObject* self, PyObject* args);
+PyObject* _tracer_clear_all_breaks(PyObject* self, PyObject* args);
+PyObject* _tracer_get_breaks(PyObject* self, PyObject* args);
+PyObject* _tracer_get_file_breaks(PyObject* self, PyObject* args);
+PyObject* get_changed_bps_lists(PyObject* self, PyObject* args);

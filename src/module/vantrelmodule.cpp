@@ -45,6 +45,24 @@ bool check_init_arguments(PyObject* const* callbacks, PyObject* import_cb, PyObj
   }
   return true;
 }
+
+// Our own hook given as the default import would make every import call itself for ever.
+// Installing the hook refuses it, but only after init has stored the callbacks; refused here
+// too, before anything changes, so a server side that made this mistake loses nothing.
+bool default_import_is_not_our_hook(PyObject* default_import) {
+  Ref hook = Ref::steal(PyObject_GetAttrString(gModuleSelf, "__import__"));
+  if (!hook) {
+    PyErr_Clear();
+    return true;
+  }
+  int same = PyObject_RichCompareBool(hook.get(), default_import, Py_EQ);
+  if (same == 0) return true;
+  if (same > 0) {
+    PyErr_SetString(PyExc_AssertionError,
+                    "The default import hook cannot be equal to our import hook");
+  }
+  return false;
+}
 }  // namespace
 
 PyObject* _tracer_init(PyObject*, PyObject* args) {
@@ -60,7 +78,10 @@ PyObject* _tracer_init(PyObject*, PyObject* args) {
                         &dprintf_file, &internal_modules_map)) {
     return nullptr;
   }
-  if (!check_init_arguments(cbs, import_cb, default_import, internal_modules_map)) return nullptr;
+  if (!check_init_arguments(cbs, import_cb, default_import, internal_modules_map) ||
+      !default_import_is_not_our_hook(default_import)) {
+    return nullptr;
+  }
   if (!__tracer_init(gModuleSelf, idle_period, exception_mode, cbs[0], cbs[1], cbs[2], cbs[3],
                      cbs[4], cbs[5], import_cb, default_import, dprintf_file,
                      internal_modules_map)) {
@@ -85,7 +106,7 @@ PyObject* _tracer_destroy(PyObject*, PyObject*) {
 namespace {
 
 #define METHOD(name, fn, doc) \
-  { name, reinterpret_cast<PyCFunction>(fn), METH_VARARGS, PyDoc_STR(doc) }
+  {name, reinterpret_cast<PyCFunction>(fn), METH_VARARGS, PyDoc_STR(doc)}
 
 PyMethodDef gMethods[] = {
     METHOD("init", _tracer_init, "initialise the core; must come first"),
@@ -118,6 +139,25 @@ PyMethodDef gMethods[] = {
     METHOD("is_botframe", _tracer_is_botframe,
            "whether the frame is the bottom frame of the calling thread"),
     METHOD("get_tracing", get_tracing, "whether tracing is active in any thread"),
+    METHOD("set_break", _tracer_set_break,
+           "Set a breakpoint at given file/line.  Pass in file, line, enabled flag,\ntemporary "
+           "flag, conditional as string (or None), and ignore count.  If\na breakpoint exists, "
+           "its values will be updated accordingly.  The new breakpoint\nid is returned as int."),
+    METHOD("clear_breaks", _tracer_clear_breaks, "Clear all breakpoints at given file/line"),
+    METHOD("enable_breaks", _tracer_enable_breaks,
+           "Enable/disable all breakpoints at given file and line number"),
+    METHOD("ignore_breaks", _tracer_ignore_breaks,
+           "Ignore all breakpoints at given file and line number for a given number\nof hits"),
+    METHOD("set_breaks_cond", _tracer_set_breaks_cond,
+           "Set conditional for all breakpoints at given file and line number; empty string to "
+           "set no conditional"),
+    METHOD("clear_all_breaks", _tracer_clear_all_breaks, "Clear all defined breakpoints"),
+    METHOD("get_breaks", _tracer_get_breaks,
+           "Get all breakpoints at given file and line number: Returns sequence of\n(id, "
+           "enabled, temporary, cond, ignore_count, hit_count) tuples"),
+    METHOD("get_file_breaks", _tracer_get_file_breaks,
+           "Get all breakpoints in given file: Returns sequence of (lineno, id\nenabled, "
+           "temporary, cond, ignore_count, hit_count) tuples"),
     METHOD("add_to_tstate_tracing", add_to_tstate_tracing,
            "Adds given value to tracing field of the current thread state.  The trace function "
            "will be called only if tracing == 0.  value can be < 0."),
@@ -155,16 +195,22 @@ PyMethodDef gMethods[] = {
            "Used to obtain list of full path names for modules that have been\nloaded or "
            "reloaded since the last call to this function.  Also clears\nthe table of new "
            "loaded/reloaded modules to blank."),
+    METHOD("set_import_cb", _tracer_set_import_cb,
+           "Set the callback called when a module is imported (may be None)"),
+    METHOD("register_module", _tracer_register_module, "Register module with the debugger"),
     METHOD("raise_exception", raise_exception,
            "Raise given exception in the thread at the next opportunity"),
     METHOD("is_internal_frame", _tracer_is_internal_frame,
            "Returns id returned by thread.get_ident for given tstate_id"),
+    METHOD("get_changed_bps_lists", get_changed_bps_lists, "Gets and clears the changed bp lists."),
     METHOD("PyFrame_LocalsToFast", wrap_PyFrame_LocalsToFast,
            "Wrapper around PyFrame_LocalsToFast internal api call."),
-    // The trace function and the thread hooks carry no docstring.
+    // The trace function, the thread hooks and __import__ carry no docstring.
     {"trace_dispatch", _tracer_trace_dispatch, METH_VARARGS, nullptr},
     {"bootstrap_new_thread", _tracer_bootstrap_new_thread, METH_VARARGS, nullptr},
     {"thread_exiting", _tracer_thread_exiting, METH_VARARGS, nullptr},
+    {"__import__", reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(_tracer_import)),
+     METH_VARARGS | METH_KEYWORDS, nullptr},
     {nullptr, nullptr, 0, nullptr},
 };
 
