@@ -138,7 +138,12 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
   s.next_idle_time = 0;
 
   __tracer_init_bp_ops_data(&s.bp_ops_data, &s.co_pathname_table);
-  __tracer_init_exception_filters(&s.exc_filters);
+  // A repeated init empties the filters of the earlier session instead of losing them.
+  if (s.exc_filters.table.buckets != nullptr) {
+    __tracer_clear_exception_filters(&s.exc_filters);
+  } else {
+    __tracer_init_exception_filters(&s.exc_filters);
+  }
   Ref new_imports = Ref::steal(PyList_New(0));
   if (!new_imports) return 0;
   s.new_imports = new_imports;

@@ -48,11 +48,19 @@ PyObject* _tracer_thread_exiting(PyObject* self, PyObject* args);
 PyObject* _tracer_is_internal_frame(PyObject* self, PyObject* args);
 PyObject* raise_exception(PyObject* self, PyObject* args);
 
-// exception_methods.cpp: the exception stop lists.
+// exception_methods.cpp: the settings of the exception decision.
 PyObject* set_always_stop_excepts(PyObject* self, PyObject* args);
 PyObject* get_always_stop_excepts(PyObject* self, PyObject* args);
 PyObject* set_never_stop_excepts(PyObject* self, PyObject* args);
 PyObject* get_never_stop_excepts(PyObject* self, PyObject* args);
+PyObject* _tracer_set_exception_mode(PyObject* self, PyObject* args);
+PyObject* _tracer_get_exception_mode(PyObject* self, PyObject* args);
+PyObject* _tracer_ignore_exception_loc(PyObject* self, PyObject* args);
+PyObject* _tracer_exception_loc_ignored(PyObject* self, PyObject* args);
+PyObject* _tracer_clear_exception_ignores(PyObject* self, PyObject* args);
+PyObject* _tracer_exiting_on_exception(PyObject* self, PyObject* args);
+PyObject* set_ignored_exception_handlers(PyObject* self, PyObject* args);
+PyObject* set_exc_catch_info_list(PyObject* self, PyObject* args);
 
 // import_methods.cpp: newly imported modules, the import callback, the replacement __import__.
 PyObject* _tracer_get_new_imports(PyObject* self, PyObject* args);

@@ -183,6 +183,28 @@ PyMethodDef gMethods[] = {
     METHOD("get_current_tstate_id", get_current_tstate_id, "Returns id of current thread state"),
     METHOD("get_thread_ident_for_tstate_id", get_thread_ident_for_tstate_id,
            "Returns id returned by thread.get_ident for given tstate_id"),
+    METHOD("set_exception_mode", _tracer_set_exception_mode,
+           "Set exception mode to use : One of kExcNeverStop=0 to never stop\non exceptions, "
+           "kExcAlwaysStop=1 to always stop on exceptions,\nor kExcUnhandledStop=2 to only stop "
+           "on unhandled exceptions.\n"),
+    METHOD("get_exception_mode", _tracer_get_exception_mode,
+           "Get exception mode in use : One of kExcNeverStop=0 to never stop\non exceptions, "
+           "kExcAlwaysStop=1 to always stop on exceptions,\nor kExcUnhandledStop=2 to only stop "
+           "on unhandled exceptions.\n"),
+    METHOD("ignore_exception_loc", _tracer_ignore_exception_loc,
+           "Ignore/un-ignore future exceptions at given file, lineno (filename must be as "
+           "given\nin the reported exception)"),
+    METHOD("exception_loc_ignored", _tracer_exception_loc_ignored,
+           "Check whether exceptions at given file / line number are being ignored bythe "
+           "debugger"),
+    METHOD("clear_exception_ignores", _tracer_clear_exception_ignores,
+           "Clear exception ignores list to blank"),
+    METHOD("exiting_on_exception", _tracer_exiting_on_exception,
+           "Returns true when the debugger core has seen an unhandled exception at the\nbottom "
+           "frame, and thus any further stepping, etc, will cause the program\nto exit.  This "
+           "is used to make sure we close the client connection cleanly\nin all cases.  Note "
+           "that this always returns false when autoquit is off\nsince the exception won't "
+           "cause exit in an embedded environment."),
     METHOD("set_always_stop_excepts", set_always_stop_excepts,
            "Set the tuple of exception types to always stop on"),
     METHOD("get_always_stop_excepts", get_always_stop_excepts,
@@ -191,6 +213,13 @@ PyMethodDef gMethods[] = {
            "Set the tuple of exception types to never stop on"),
     METHOD("get_never_stop_excepts", get_never_stop_excepts,
            "Get the tuple of exception types to never stop on"),
+    METHOD("set_ignored_exception_handlers", set_ignored_exception_handlers,
+           "Sets the dictionary of ignored handlers.  Keys may be either frame or code objects "
+           "to ignore"),
+    METHOD("set_exc_catch_info_list", set_exc_catch_info_list,
+           "Set list of exception info instances.  Each instance should have co_name, "
+           "module_name, prints, ignore, & parent attributes.  Class for these instances is "
+           "defined in selvane.py."),
     METHOD("get_new_imports", _tracer_get_new_imports,
            "Used to obtain list of full path names for modules that have been\nloaded or "
            "reloaded since the last call to this function.  Also clears\nthe table of new "
