@@ -390,14 +390,16 @@ int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
   if (retval == nullptr) {
     // Left by an exception: the latest exception event in the frame says which one.
     Ref recorded = Ref::borrow(find_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame));
-    if (dispatch_exception_return(frame, recorded.get()) != 0) return forget_exception_of(frame, -1);
+    if (dispatch_exception_return(frame, recorded.get()) != 0)
+      return forget_exception_of(frame, -1);
     if (untraced_after_stop(frame)) return 0;
   }
   bool sub_language = __tracer_sub_language_get_frame_category(data, frame) != -1;
   bool stop = (!sub_language && data->step_out_frame.is(frame)) || stop_here_for(data, frame, 2);
   if (stop) {
     PyObject* value = retval != nullptr ? retval : Py_None;
-    if (do_callback(gSelf.return_cb.get(), frame, value) != 0) return forget_exception_of(frame, -1);
+    if (do_callback(gSelf.return_cb.get(), frame, value) != 0)
+      return forget_exception_of(frame, -1);
   } else if (data->bot_frame.is(frame)) {
     unsigned long identity = data->thread_id;
     enter_debugger();  // dropping the frame may run finalizers

@@ -21,8 +21,6 @@
 
 namespace {
 
-constexpr int kMatchSameFrameClauses = 1;  // given-exception-matches; a bare except: does not count
-constexpr int kMatchAnyHandler = 0;        // given-exception-matches; a bare except: catches
 constexpr int kRecursionHeadroom = 50;
 
 bool matches_list(PyObject* exc_type, const Ref& list) {
@@ -98,8 +96,8 @@ bool frame_place(PyObject* inner, ReportedPlace& place) {
     if (place.file == nullptr) PyErr_Clear();
   }
   if (!place.loc) {
-    place.loc = Ref::steal(
-        PyLong_FromLong(PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(inner))));
+    place.loc =
+        Ref::steal(PyLong_FromLong(PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(inner))));
   }
   return place.file != nullptr && place.loc;
 }
@@ -136,10 +134,11 @@ bool is_recursion_depth_error(PyObject* exc_arg) {
 // The exception being handled now, as an event argument: (type, value, traceback).
 Ref handled_exception_arg() {
   Ref value = Ref::steal(PyErr_GetHandledException());
-  if (!value || value.is_none()) return Ref::steal(Py_BuildValue("(OOO)", Py_None, Py_None, Py_None));
+  if (!value || value.is_none())
+    return Ref::steal(Py_BuildValue("(OOO)", Py_None, Py_None, Py_None));
   Ref tb = Ref::steal(PyException_GetTraceback(value.get()));
-  return Ref::steal(Py_BuildValue("(OOO)", Py_TYPE(value.get()), value.get(),
-                                  tb ? tb.get() : Py_None));
+  return Ref::steal(
+      Py_BuildValue("(OOO)", Py_TYPE(value.get()), value.get(), tb ? tb.get() : Py_None));
 }
 
 }  // namespace
@@ -177,20 +176,22 @@ int stop_at_exception_no_filters(PyObject* frame, PyObject* exc_type, PyObject* 
     return 0;
   }
   if (leaves_bottom_frame(frame)) return 1;
-  PyObject* exc = value_of(exc_arg);
+  // The instance where the event carries one (always, on current interpreters), else the type.
+  PyObject* exc = value_of(exc_arg) != Py_None ? value_of(exc_arg) : exc_type;
   PyObject* ignored = s.ignored_exception_handlers.get();
   // The handler analysis and the catch-info list may run Python code (the class expressions
   // of except clauses, the instances' attributes): the thread enters the debugger first.
   if (matches_list(exc_type, s.always_stop_excepts)) {
     enter_debugger();
-    if (!__tracer_exc_handled(frame, ignored, exc_type, exc, kMatchSameFrameClauses, 1)) {
+    // Only an explicit clause of the raising frame itself lets an always-stop type pass.
+    if (!__tracer_exc_handled(frame, ignored, exc, kMatchGivenExplicit, 1)) {
       do_dprintf(kDbgFlow, "  always stop\n");
       return 1;
     }
   }
   if (s.exception_mode == kExcUnhandledStop) {
     enter_debugger();
-    if (!__tracer_exc_handled(frame, ignored, exc_type, exc, kMatchAnyHandler, 0)) {
+    if (!__tracer_exc_handled(frame, ignored, exc, kMatchGiven, 0)) {
       do_dprintf(kDbgFlow, "  unhandled\n");
       return 1;
     }
