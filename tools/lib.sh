@@ -150,10 +150,9 @@ as_root() {
   if [ "$(id -u)" = 0 ]; then "$@"; else sudo "$@"; fi
 }
 
-root_fail() {  # reason: kept in ROOT_FAILURE for the caller's report
+root_fail() {  # reason: kept in ROOT_FAILURE for the caller's report; the caller returns 1
   ROOT_FAILURE="$1"
   echo "$1" >&2
-  return 1
 }
 
 # Makes the root unless a complete one is there. On failure says why (also in ROOT_FAILURE)
