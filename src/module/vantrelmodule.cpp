@@ -9,6 +9,7 @@
 
 #include "core/dispatch.h"
 #include "core/tracercore.h"
+#include "exc/handlers.h"
 #include "module/methods.h"
 #include "support/dbgcommon.h"
 #include "support/dprintf.h"
@@ -287,6 +288,9 @@ PyMODINIT_FUNC PyInit_tvantrel30pydebugstackless(void) {
   if (gModuleSelf == nullptr) return nullptr;
   init_threadops();
   init_tracercore();
+  // The handler analysis reads the interpreter's opcode tables now, never inside an event;
+  // when they cannot be read it answers "not caught" everywhere.
+  init_handler_analysis();
   // A forked child is never traced; the handler only sets a flag that the next event reads.
   pthread_atfork(nullptr, nullptr, note_fork_in_child);
   do_dprintf(kDbgFlow, "Initialize vantrel module complete\n");
