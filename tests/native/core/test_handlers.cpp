@@ -280,7 +280,18 @@ def main():
 }
 
 TEST_F(HandlerTest, FrameHandlersIgnoredDirectly) {
-  Ref ns = coretest::make_namespace("def f():\n    probe()\n");
+  Ref ns = coretest::make_namespace(R"(
+class BadKey:
+    # Collides with the code object's hash and raises when compared.
+    def __init__(self, code):
+        self.h = hash(code)
+    def __hash__(self):
+        return self.h
+    def __eq__(self, other):
+        raise RuntimeError('compare')
+def f():
+    probe()
+)");
   Ref ignored = Ref::steal(PyDict_New());
   bool ran = coretest::run_in_frame(ns.get(), "f", [&](PyFrameObject* frame) {
     auto* f = reinterpret_cast<PyObject*>(frame);
@@ -296,6 +307,11 @@ TEST_F(HandlerTest, FrameHandlersIgnoredDirectly) {
     EXPECT_EQ(frame_handlers_ignored(Py_None, ignored.get()), 0);
     // A key whose comparison raises: cleared, counts as not ignored.
     PyDict_Clear(ignored.get());
+    Ref bad = Ref::steal(PyObject_CallOneArg(coretest::item(ns.get(), "BadKey"), code.get()));
+    ASSERT_TRUE(bad);
+    PyDict_SetItem(ignored.get(), bad.get(), Py_True);
+    EXPECT_EQ(frame_handlers_ignored(f, ignored.get()), 0);
+    EXPECT_EQ(PyErr_Occurred(), nullptr);
   });
   EXPECT_TRUE(ran);
 }
