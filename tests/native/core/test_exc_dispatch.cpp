@@ -15,6 +15,7 @@
 #include "core/exception_dispatch.h"
 #include "core/tracercore.h"
 #include "exc/exceptops.h"
+#include "exc/handlers.h"
 #include "names/conames.h"
 #include "tracer_fixture.h"
 
@@ -46,6 +47,27 @@ class Info:
 def host():
     return probe()
 
+def bottom_plain():
+    x = 1
+    return probe()
+
+def bottom_in_finally():
+    try:
+        return probe()
+    finally:
+        pass
+
+def bottom_in_try_except():
+    try:
+        return probe()
+    except ValueError:
+        pass
+
+def bottom_in_with():
+    import contextlib
+    with contextlib.nullcontext():
+        return probe()
+
 def host_in_except():
     try:
         raise KeyError('handled')
@@ -55,6 +77,8 @@ def host_in_except():
 
 class ExcDispatchTest : public coretest::TracerStateTest {
  protected:
+  // Module load prepares the byte-code tables of the handler analysis.
+  static void SetUpTestSuite() { ASSERT_EQ(init_handler_analysis(), 0); }
   void SetUp() override {
     TracerStateTest::SetUp();
     ns_ = coretest::make_namespace(kServerSide);
@@ -208,6 +232,66 @@ TEST_F(ExcDispatchTest, ResetKeepsTheCatchInfoListAndDropsTheRecords) {
     EXPECT_EQ(frame_prints_exc(&gSelf.exc_data, reinterpret_cast<PyObject*>(f)), 1);
   });
   EXPECT_TRUE(ran);
+}
+
+// The bottom frame rule: an exception in the thread's outermost frame that nothing there can
+// catch stops the program in every mode, and tells the server side that it is about to end.
+// "Nothing can catch" means no exception-table entry covers the instruction, leaving aside the
+// entries the compiler adds around every handler body.
+TEST_F(ExcDispatchTest, ExceptionInTheBottomFrameWithoutAHandlerStopsInNeverMode) {
+  Ref log = coretest::make_namespace("import io\nf = io.StringIO()\n");
+  const unsigned int mask = gDPrintfMask;
+  gDPrintfMask = kDbgFlow | kDbgExceptions;
+  struct Case {
+    const char* function;
+    bool bottom;
+    int expected;
+  };
+  for (const Case& c : {Case{"bottom_plain", true, 1}, Case{"bottom_in_finally", true, 0},
+                        Case{"bottom_in_try_except", true, 0}, Case{"bottom_in_with", true, 0},
+                        Case{"bottom_plain", false, 0}}) {
+    for (int mode : {0, 7}) {
+      gSelf.exception_mode = mode;
+      ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+      ASSERT_NE(data, nullptr);
+      data->leaving_bot_frame = 0;
+      int answer = -1;
+      set_dprintf_file(item(log.get(), "f"));
+      bool ran = coretest::run_in_frame(ns_.get(), c.function, [&](PyFrameObject* f) {
+        PyObject* frame = reinterpret_cast<PyObject*>(f);
+        data->bot_frame = c.bottom ? Ref::borrow(frame) : Ref::none();
+        Ref arg = Ref::steal(Py_BuildValue("(OOO)", PyExc_KeyError, Py_None, Py_None));
+        answer = stop_at_exception_no_filters(frame, PyExc_KeyError, arg.get());
+        data->bot_frame = Ref::none();
+      });
+      set_dprintf_file(nullptr);
+      ASSERT_TRUE(ran);
+      EXPECT_EQ(answer, c.expected) << c.function << " bottom=" << c.bottom << " mode " << mode;
+      EXPECT_EQ(data->leaving_bot_frame, c.expected) << c.function;
+    }
+  }
+  // The never-stop list is asked first.
+  gSelf.exception_mode = 0;
+  gSelf.never_stop_excepts = Ref::steal(Py_BuildValue("(O)", PyExc_LookupError));
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  data->leaving_bot_frame = 0;
+  int answer = -1;
+  set_dprintf_file(item(log.get(), "f"));
+  coretest::run_in_frame(ns_.get(), "bottom_plain", [&](PyFrameObject* f) {
+    PyObject* frame = reinterpret_cast<PyObject*>(f);
+    data->bot_frame = Ref::borrow(frame);
+    Ref arg = Ref::steal(Py_BuildValue("(OOO)", PyExc_KeyError, Py_None, Py_None));
+    answer = stop_at_exception_no_filters(frame, PyExc_KeyError, arg.get());
+    data->bot_frame = Ref::none();
+  });
+  set_dprintf_file(nullptr);
+  gDPrintfMask = mask;
+  EXPECT_EQ(answer, 0);
+  EXPECT_EQ(data->leaving_bot_frame, 0);
+  Ref text = Ref::steal(PyObject_CallMethod(item(log.get(), "f"), "getvalue", nullptr));
+  std::string debug = PyUnicode_AsUTF8(text.get());
+  EXPECT_NE(debug.find("  leaving bottom frame\n"), std::string::npos) << debug;
+  EXPECT_NE(debug.find("  never stop\n"), std::string::npos) << debug;
 }
 
 // ---- the filter table --------------------------------------------------------------------------
