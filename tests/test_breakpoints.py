@@ -303,6 +303,29 @@ def test_a_file_name_of_40000_characters_is_kept_whole(table):
     assert core.get_file_breaks(name) == []
 
 
+def test_file_names_beyond_the_path_buffers_in_a_traced_program(tmp_path):
+    # Module code and functions whose file names are 32000 to 40001 bytes long, registered and
+    # run under breakpoints on those names: nothing overflows, the program runs normally.
+    # Such names cannot be resolved, so no breakpoint of an ordinary frame matches them.
+    source = """
+    import types
+    import tvantrel30pydebugstackless as core
+    LONG = "/" + "d" * 39995 + "/x.py"
+    for name in (LONG, LONG[:32000], LONG[:32001], LONG[:31999]):
+        exec(compile("v = 1\\nv = 2\\n", name, "exec"), {"__file__": name})
+        module = types.ModuleType("m")
+        module.__file__ = name
+        print(core.register_module(module) is None or len(core.register_module(module)))
+    print("done")
+    """
+    long_name = "/" + "d" * 39995 + "/x.py"
+    breaks = [[name, 1, 1, 0, None, 0] for name in (long_name, long_name[:32000])]
+    run = run_traced(tmp_path, source, breaks=breaks, files=["x.py"], **CONTINUE)
+    assert run.returncode == 0, run.stderr
+    assert run.stdout.splitlines()[-1] == "done"
+    assert len(run.stdout.splitlines()) == 5
+
+
 # ---- traced runs ----------------------------------------------------------------------------
 
 CONTINUE = dict(first="continue_run", default="continue_run", when_elsewhere="continue_run")
