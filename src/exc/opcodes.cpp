@@ -205,8 +205,10 @@ bool calibrate_operands(Opcodes* table) {
 bool load_table(Opcodes* table) {
   Ref opcode_module = Ref::steal(PyImport_ImportModule("opcode"));
   if (!opcode_module) return false;
-  Ref opmap = Ref::steal(PyObject_GetAttrString(opcode_module.get(), "opmap"));
-  if (!opmap || !PyDict_Check(opmap.get())) return false;
+  // A plain dict copy: 3.15 publishes the map as a frozendict, which is no dict subclass.
+  Ref published = Ref::steal(PyObject_GetAttrString(opcode_module.get(), "opmap"));
+  Ref opmap = Ref::steal(PyDict_New());
+  if (!published || !opmap || PyDict_Merge(opmap.get(), published.get(), 1) != 0) return false;
   for (int role = 0; role < kOpCount; ++role) {
     table->op[role] = opcode_by_alternatives(opmap.get(), kOpNames[role]);
   }
