@@ -15,6 +15,11 @@ Modes:
   null-c-locked   the same, taking and releasing one thread lock per event
   core-free       the core installed and running freely (continue_run, no breakpoint): the
                   common case of a program under the debugger
+  core-bp-elsewhere  the core running freely with one breakpoint in another file (this
+                  one), on a line number that no line of the workload has: each line event
+                  costs the lookup of its line number in a breakpoint table that is not empty
+  core-bp-unreached  the core running freely with one breakpoint in the workload's own file,
+                  on a line the workload never reaches (as the bdb mode has it)
   core-step-over  the core stepping over a call: stopped in a driver frame, the command is
                   step_over, and the driver then calls the workload, so every event of the
                   workload is one where the core must find that the stop frame is an outer
@@ -51,6 +56,9 @@ sys.path.insert(0, HERE)
 import workload as wl  # noqa: E402
 
 perf_counter = time.perf_counter
+# The interpreter's own import function: init replaces the builtins' __import__ with the
+# core's hook, and a later init must be given the original, not the hook.
+_ORIGINAL_IMPORT = __import__
 VERSION = platform.python_version()
 
 
@@ -151,8 +159,8 @@ class _CallbackCounter:
 
 
 def _init_core(core, line_cb, return_cb, exception_cb):
-    core.init(0.0, 0, _noop, _noop, line_cb, return_cb, exception_cb, _noop, None, __import__,
-              None, {})
+    core.init(0.0, 0, _noop, _noop, line_cb, return_cb, exception_cb, _noop, None,
+              _ORIGINAL_IMPORT, None, {})
 
 
 def _check_core_installed():
@@ -175,6 +183,42 @@ def mode_core_free(n):
     if any(counter.calls.values()):
         raise Failed(f"the core stopped while running freely: callbacks {counter.calls}")
     return elapsed
+
+
+def _run_core_with_breakpoint(n, filename, line):
+    core = _core()
+    counter = _CallbackCounter()
+    _init_core(core, counter.line, counter.ret, counter.exc)
+    core.set_break(filename, line, 1, 0, None, 0)
+    core.continue_run()
+    core.start_trace()
+    try:
+        _check_core_installed()
+        elapsed = timed(n)
+    finally:
+        core.stop_trace()
+        core.reset()
+    if any(counter.calls.values()):
+        raise Failed(f"the core stopped at an unreached breakpoint: callbacks {counter.calls}")
+    return elapsed
+
+
+def _workload_lines():
+    lines = set()
+    for function in (wl.leaf, wl.workload):
+        lines.update(line for _, _, line in function.__code__.co_lines() if line is not None)
+    return lines
+
+
+def mode_core_bp_elsewhere(n):
+    line = never_reached_line(_never_called_here)
+    if line in _workload_lines():
+        raise Failed(f"line {line} of this file is also a line of the workload")
+    return _run_core_with_breakpoint(n, __file__, line)
+
+
+def mode_core_bp_unreached(n):
+    return _run_core_with_breakpoint(n, wl.__file__, never_reached_line(wl.never_called))
 
 
 def _stepped_driver(n):
@@ -309,6 +353,8 @@ MODES = {
     "null-c": mode_null,
     "null-c-locked": mode_null_locked,
     "core-free": mode_core_free,
+    "core-bp-elsewhere": mode_core_bp_elsewhere,
+    "core-bp-unreached": mode_core_bp_unreached,
     "core-step-over": mode_core_step_over,
     "bdb": mode_bdb,
     "bdb-elsewhere": mode_bdb_elsewhere,
@@ -440,19 +486,19 @@ def print_table(rows, skipped, events, counts, c_counts, iterations, repeats):
         seen = sum(c_counts.values())
         print(f"  the counting C tracer saw {seen} events over the timed span "
               f"({seen - events:+d}: the timing line's own events)")
-    header = (f"{'mode':<16}{'best s':>10}{'median s':>10}{'ns/event':>10}"
+    header = (f"{'mode':<19}{'best s':>10}{'median s':>10}{'ns/event':>10}"
               f"{'+ns over null':>15}{'x null':>8}")
     print(header)
     print("-" * len(header))
     for mode, row in rows.items():
         above = row["ns_per_event_above_floor"]
         ratio = row["ratio_to_floor"]
-        print(f"{mode:<16}{row['best_s']:>10.4f}{row['median_s']:>10.4f}"
+        print(f"{mode:<19}{row['best_s']:>10.4f}{row['median_s']:>10.4f}"
               f"{row['ns_per_event']:>10.1f}"
               f"{(f'{above:+.1f}' if above is not None else '-'):>15}"
               f"{(f'{ratio:.2f}' if ratio is not None else '-'):>8}")
     for mode, reason in skipped.items():
-        print(f"{mode:<16}skipped: {reason}")
+        print(f"{mode:<19}skipped: {reason}")
 
 
 def main(argv=None):
