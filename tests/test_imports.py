@@ -478,3 +478,65 @@ def test_set_import_cb_replaces_the_callback_and_keeps_one_reference(initialised
 def test_the_new_imports_list_is_empty_after_init(initialised):
     assert core.get_new_imports() == []
     assert core.get_new_imports() == []
+
+
+def test_no_thread_stops_by_stepping_while_an_import_callback_runs(tmp_path):
+    # A worker steps into its own lines while the main thread's import callback runs: none
+    # of them stops. Without the callback in the way (the control run) the same lines stop.
+    (tmp_path / "mods").mkdir(exist_ok=True)
+    (tmp_path / "mods" / "sync.py").write_text(
+        "import threading\ngo = threading.Event()\ndone = threading.Event()\n")
+    source = """
+    import threading
+    import sync
+    under_debugger = "_scripted_shared" in sys.modules
+    if under_debugger:
+        import tvantrel30pydebugstackless as core
+
+    def worker():
+        sync.go.wait(10)
+        if under_debugger:
+            core.step_into()
+        a = 1
+        b = a + 1
+        if under_debugger:
+            core.continue_run()
+        sync.done.set()
+
+    t = threading.Thread(target=worker, name="worker")
+    t.start()
+    import alpha
+    sync.go.set()
+    sync.done.wait(10)
+    t.join()
+    print("joined")
+    """
+    waiting = ("if module.__name__ == 'alpha':\n"
+               "    import sys\n"
+               "    sys.modules['sync'].go.set()\n"
+               "    sys.modules['sync'].done.wait(10)")
+    run = traced(tmp_path, source, import_cb=True, import_cb_exec=waiting,
+                 record_threads=True)
+    assert_stops(run.stops, [])
+    control = traced(tmp_path, source, record_threads=True)
+    # The first line after step_into stops (the answer is continue_run); traced() puts two
+    # lines in front of the source.
+    assert [s[2] for s in control.stops] == [13], control.stops
+    assert {s[-1] for s in control.stops} == {"worker"}
+
+
+def test_the_hook_goes_into_the_builtins_module_when_no_frame_runs():
+    # A thread started at a C function has no Python frame: init called that way installs
+    # the hook in the builtins module's dictionary.
+    import _thread
+    import time
+    builtins.__import__ = ORIGINAL_IMPORT
+    try:
+        _thread.start_new_thread(core.init, tuple(init_args()))
+        deadline = time.monotonic() + 10
+        while builtins.__import__ is ORIGINAL_IMPORT and time.monotonic() < deadline:
+            time.sleep(0.005)
+        assert builtins.__import__ == core.__import__
+    finally:
+        core.init(*init_args())
+        core.reset()
