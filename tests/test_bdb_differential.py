@@ -34,7 +34,6 @@ import subprocess
 import sys
 import textwrap
 
-import pytest
 
 from conftest import TIMEOUT, assert_stops, run_traced, write_program
 

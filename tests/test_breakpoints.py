@@ -333,9 +333,10 @@ CONTINUE = dict(first="continue_run", default="continue_run", when_elsewhere="co
 
 def traced(tmp_path, source, breaks, modules=None, **config):
     """Traces `source` as prog.py with `modules` ({relative path: source}) written beside it,
-    the breakpoints `breaks` ([file, line, enabled, temporary, cond, ignore]; a file "prog.py"
-    or a relative path is made absolute unless the test gives it as it should be kept), and
-    continue_run from the start. The traced run must print what an untraced run prints."""
+    the breakpoints `breaks` ([file, line, enabled, temporary, cond, ignore], file names as
+    given: relative names are relative to the test's folder, the traced program's working
+    folder) and continue_run from the start. The traced run must print what an untraced run
+    prints."""
     program = write_program(tmp_path, source)
     for name, text in (modules or {}).items():
         os.makedirs(os.path.dirname(str(tmp_path / name)), exist_ok=True)
@@ -676,7 +677,8 @@ def test_a_breakpoint_set_before_tracing_on_a_module_loaded_before_tracing(tmp_p
     at = marked(MOD, "inf")
     prelude = ("import os, sys; sys.path.insert(0, os.path.abspath('mods')); import mod; "
                f"core.set_break('alias.py', {at}, 1, 0, None, 0)")
-    program = "import os, sys\nsys.path.insert(0, os.path.abspath('mods'))\nimport mod\nprint(mod.f(3))\n"
+    program = ("import os, sys\nsys.path.insert(0, os.path.abspath('mods'))\n"
+               "import mod\nprint(mod.f(3))\n")
     run = traced(tmp_path, program, [], files=["mod.py"], prelude=prelude)
     assert_stops(run.stops, [line(at, "f", "mod.py")])
 
