@@ -133,7 +133,7 @@ bool take_hit(BpOpsData* data, Breakpoint* bp, int count) {
 int __tracer_break_here(BpOpsData* data, int event, ThreadData* thread, PyObject* frame,
                         int count) {
   if (!compat::is_plain_frame(frame)) return 0;
-  LineEvent at{thread, frame, event};
+  LineEvent at{thread, frame, event, nullptr, 0, false, Ref()};
   if (__tracer_sub_language_get_frame_category(thread, frame) == 1) {
     enter_debugger();  // the hook is Python code
     if (!translate_sub_language_frame(at)) return 0;
