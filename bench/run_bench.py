@@ -15,6 +15,11 @@ Modes:
   null-c-locked   the same, taking and releasing one thread lock per event
   core-free       the core installed and running freely (continue_run, no breakpoint): the
                   common case of a program under the debugger
+  core-bp-elsewhere  the core running freely with one breakpoint in another file (this
+                  one), on a line number that no line of the workload has: each line event
+                  costs the lookup of its line number in a breakpoint table that is not empty
+  core-bp-unreached  the core running freely with one breakpoint in the workload's own file,
+                  on a line the workload never reaches (as the bdb mode has it)
   core-step-over  the core stepping over a call: stopped in a driver frame, the command is
                   step_over, and the driver then calls the workload, so every event of the
                   workload is one where the core must find that the stop frame is an outer
@@ -61,6 +66,9 @@ sys.path.insert(0, HERE)
 import workload as wl  # noqa: E402
 
 perf_counter = time.perf_counter
+# The interpreter's own import function: init replaces the builtins' __import__ with the
+# core's hook, and a later init must be given the original, not the hook.
+_ORIGINAL_IMPORT = __import__
 VERSION = platform.python_version()
 
 
@@ -161,14 +169,9 @@ class _CallbackCounter:
         self.calls["exception"] += 1
 
 
-# init puts the core's import hook into the builtins: every later init is given the
-# interpreter's own import function, kept from before the first one.
-_DEFAULT_IMPORT = __import__
-
-
 def _init_core(core, line_cb, return_cb, exception_cb):
     core.init(0.0, 0, _noop, _noop, line_cb, return_cb, exception_cb, _noop, None,
-              _DEFAULT_IMPORT, None, {})
+              _ORIGINAL_IMPORT, None, {})
 
 
 def _check_core_installed():
@@ -213,6 +216,42 @@ def mode_exc_core_never(n):
 
 def mode_exc_core_unhandled(n):
     return mode_core_free(n, wl.exc_workload, exception_mode=2)
+
+
+def _run_core_with_breakpoint(n, filename, line):
+    core = _core()
+    counter = _CallbackCounter()
+    _init_core(core, counter.line, counter.ret, counter.exc)
+    core.set_break(filename, line, 1, 0, None, 0)
+    core.continue_run()
+    core.start_trace()
+    try:
+        _check_core_installed()
+        elapsed = timed(n)
+    finally:
+        core.stop_trace()
+        core.reset()
+    if any(counter.calls.values()):
+        raise Failed(f"the core stopped at an unreached breakpoint: callbacks {counter.calls}")
+    return elapsed
+
+
+def _workload_lines():
+    lines = set()
+    for function in (wl.leaf, wl.workload):
+        lines.update(line for _, _, line in function.__code__.co_lines() if line is not None)
+    return lines
+
+
+def mode_core_bp_elsewhere(n):
+    line = never_reached_line(_never_called_here)
+    if line in _workload_lines():
+        raise Failed(f"line {line} of this file is also a line of the workload")
+    return _run_core_with_breakpoint(n, __file__, line)
+
+
+def mode_core_bp_unreached(n):
+    return _run_core_with_breakpoint(n, wl.__file__, never_reached_line(wl.never_called))
 
 
 def _stepped_driver(n):
@@ -347,6 +386,8 @@ MODES = {
     "null-c": mode_null,
     "null-c-locked": mode_null_locked,
     "core-free": mode_core_free,
+    "core-bp-elsewhere": mode_core_bp_elsewhere,
+    "core-bp-unreached": mode_core_bp_unreached,
     "core-step-over": mode_core_step_over,
     "exc-untraced": mode_exc_untraced,
     "exc-null-c": mode_exc_null,
