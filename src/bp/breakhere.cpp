@@ -144,9 +144,12 @@ bool take_hit(BpOpsData* data, Breakpoint* bp, int count) {
 
 int __tracer_break_here(BpOpsData* data, int event, ThreadData* thread, PyObject* frame,
                         int count) {
-  if (!compat::is_plain_frame(frame)) return 0;
+  // No breakpoint anywhere: nothing to find, whatever the frame (the common line event).
+  if (data->bp_table.num_entries == 0 || !compat::is_plain_frame(frame)) return 0;
   LineEvent at{thread, frame, event, nullptr, 0, false, Ref()};
-  if (__tracer_sub_language_get_frame_category(thread, frame) == 1) {
+  // Only a thread inside a sub-language has key frames (an inline test before the call).
+  if (thread != nullptr && thread->sub_language_hook &&
+      __tracer_sub_language_get_frame_category(thread, frame) == 1) {
     enter_debugger();  // the hook is Python code
     if (!translate_sub_language_frame(at)) return 0;
   } else {
