@@ -17,8 +17,10 @@
 #include "core/imports.h"
 #include "core/install.h"
 #include "core/stepping.h"
+#include "core/sublang.h"
 #include "core/thread_policy.h"
 #include "core/tracercore.h"
+#include "exc/exceptops.h"
 #include "names/conames.h"
 #include "support/dbgcommon.h"
 #include "support/dprintf.h"
@@ -372,24 +374,33 @@ void call_quit_cb_if_autoquit() {
   saved.restore();
 }
 
+namespace {
+// The frame returns: its exception record, if any, is no longer needed.
+int forget_exception_of(PyObject* frame, int result) {
+  if (gSelf.exc_data.frame_exc_info) {
+    enter_debugger();  // dropping a record can run finalizers
+    forget_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame);
+  }
+  return result;
+}
+}  // namespace
+
 int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
   if (!gSelf.trace_started) return -1;
   if (retval == nullptr) {
-    if (dispatch_exception_return(frame, nullptr) != 0) return -1;
+    // Left by an exception: the latest exception event in the frame says which one.
+    Ref recorded = Ref::borrow(find_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame));
+    if (dispatch_exception_return(frame, recorded.get()) != 0)
+      return forget_exception_of(frame, -1);
     if (untraced_after_stop(frame)) return 0;
-    // Giving up the bottom frame may have run code: the record is looked up again.
-    data = current_thread_data_or_insert(&gSelf.thread_table);
-    if (data == nullptr) {
-      PyErr_Clear();
-      return 0;
-    }
   }
-  bool stop = data->step_out_frame.is(frame) || stop_here_for(data, frame, 2);
+  bool sub_language = __tracer_sub_language_get_frame_category(data, frame) != -1;
+  bool stop = (!sub_language && data->step_out_frame.is(frame)) || stop_here_for(data, frame, 2);
   if (stop) {
     PyObject* value = retval != nullptr ? retval : Py_None;
-    return do_callback(gSelf.return_cb.get(), frame, value) != 0 ? -1 : 0;
-  }
-  if (data->bot_frame.is(frame)) {
+    if (do_callback(gSelf.return_cb.get(), frame, value) != 0)
+      return forget_exception_of(frame, -1);
+  } else if (data->bot_frame.is(frame)) {
     unsigned long identity = data->thread_id;
     enter_debugger();  // dropping the frame may run finalizers
     data->bot_frame = Ref::none();
@@ -397,7 +408,7 @@ int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
     __clear_should_debug_thread_cache(identity);
     if (untraced_after_stop(frame)) return 0;
   }
-  return 0;
+  return forget_exception_of(frame, 0);
 }
 
 int do_callback(PyObject* cb, PyObject* frame, PyObject* arg) {

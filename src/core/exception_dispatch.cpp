@@ -1,17 +1,147 @@
 // exception_dispatch.cpp: what the tracer does with exception events and with frames that
 // an exception leaves, and the delivery of exceptions injected with raise_exception.
 //
-// The decision by exception mode uses only the always-stop mode and the stepping state for
-// now; the stop lists, the handler prediction from the byte code and the location filters
-// join it with the exception analysis.
+// The decision (stop_at_exception_no_filters) takes only the frame and the exception: it
+// does not care how the event arrived, so any event source can ask it.
 #include "core/exception_dispatch.h"
+
+#include <cstring>
 
 #include "core/dispatch.h"
 #include "core/stepping.h"
+#include "core/sublang.h"
 #include "core/thread_policy.h"
 #include "core/tracercore.h"
+#include "exc/exceptops.h"
+#include "exc/handlers.h"
+#include "names/conames.h"
+#include "support/dbgcommon.h"
 #include "support/dprintf.h"
 #include "support/pycompat.h"
+
+namespace {
+
+constexpr int kRecursionHeadroom = 50;
+
+bool matches_list(PyObject* exc_type, const Ref& list) {
+  return list && PyErr_GivenExceptionMatches(exc_type, list.get());
+}
+
+bool prints_mode() {
+  return gSelf.exception_mode == 4 || gSelf.exception_mode == 5;
+}
+
+// The exception value of an event's argument (its instance on every current interpreter).
+PyObject* value_of(PyObject* exc_arg) {
+  return PyTuple_GET_SIZE(exc_arg) > 1 ? PyTuple_GET_ITEM(exc_arg, 1) : Py_None;
+}
+
+// Rule: an exception in the thread's bottom frame that nothing there can catch ends the
+// program. Stop, and let the server side know it can close its connection cleanly.
+bool leaves_bottom_frame(PyObject* frame) {
+  if (!compat::is_plain_frame(frame)) return false;
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data == nullptr) {
+    PyErr_Clear();
+    return false;
+  }
+  if (!data->bot_frame.is(frame) || frame_has_active_handler(frame)) return false;
+  do_dprintf(kDbgFlow, "  leaving bottom frame\n");
+  data->leaving_bot_frame = 1;
+  return true;
+}
+
+// The place where the exception really happened: the innermost frame of its traceback.
+Ref innermost_frame(PyObject* frame, PyObject* exc_arg) {
+  if (PyTuple_GET_SIZE(exc_arg) < 3) return Ref();
+  PyObject* tb = PyTuple_GET_ITEM(exc_arg, 2);
+  if (tb == Py_None) return Ref::borrow(frame);
+  Ref inner = Ref::steal(__find_inner_frame(tb));
+  if (!inner) PyErr_Clear();
+  return inner;
+}
+
+// Where the exception is reported: the file name and location object of the inner frame, or
+// of the sub-language line it translates to. False when no exception may be reported here.
+struct ReportedPlace {
+  const char* file = nullptr;
+  Ref loc;
+  Ref translated;  // keeps a translated file name alive
+};
+
+bool sub_language_place(ThreadData* data, PyObject* inner, ReportedPlace& place) {
+  int category = __tracer_sub_language_get_frame_category(data, inner);
+  if (category == 0) return false;  // hidden implementation frames never report
+  if (category != 1) return true;
+  PyObject* hook = data->sub_language_hook.get();
+  compat::PendingError saved;
+  saved.fetch();
+  Ref stop = Ref::steal(PyObject_CallMethod(hook, "_StopHere", "Oii", inner, -1, -1));
+  bool wanted = stop && PyObject_IsTrue(stop.get()) > 0;
+  if (wanted) {
+    place.translated = Ref::steal(PyObject_CallMethod(hook, "_TranslateFrame", "Oi", inner, 1));
+    PyObject* t = place.translated.get();
+    if (t != nullptr && PyTuple_Check(t) && PyTuple_GET_SIZE(t) >= 2) {
+      place.file = _pystring_to_c_string(PyTuple_GET_ITEM(t, 0));
+      place.loc = Ref::borrow(PyTuple_GET_ITEM(t, 1));
+    }
+  }
+  saved.restore();
+  return wanted;
+}
+
+bool frame_place(PyObject* inner, ReportedPlace& place) {
+  if (place.file == nullptr) {
+    place.file = __tracer_get_full_path(&gSelf.co_pathname_table, inner);
+    if (place.file == nullptr) PyErr_Clear();
+  }
+  if (!place.loc) {
+    place.loc =
+        Ref::steal(PyLong_FromLong(PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(inner))));
+  }
+  return place.file != nullptr && place.loc;
+}
+
+bool filtered(const ReportedPlace& place, PyObject* inner) {
+  ExcFilter* found =
+      __tracer_exc_filtered(&gSelf.exc_filters, gSelf.file_ops_data, place.file, place.loc.get());
+  if (PyErr_Occurred() != nullptr) PyErr_Clear();  // a translated location of another shape
+  if (found != nullptr) return true;
+  int line = PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(inner));
+  return __tracer_exc_filtered_hack(place.file, line) != 0;
+}
+
+// A recursion-depth error: the server side's own code needs some room to run at that depth.
+// The message is read from the exception instance (its first argument when that is a str).
+bool is_recursion_depth_error(PyObject* exc_arg) {
+  PyObject* type = PyTuple_GET_ITEM(exc_arg, 0);
+  if (type == Py_None || !PyErr_GivenExceptionMatches(type, PyExc_RuntimeError)) return false;
+  PyObject* value = value_of(exc_arg);
+  PyObject* message = value;
+  if (PyExceptionInstance_Check(value)) {
+    PyObject* args = reinterpret_cast<PyBaseExceptionObject*>(value)->args;
+    message = args != nullptr && PyTuple_Check(args) && PyTuple_GET_SIZE(args) > 0
+                  ? PyTuple_GET_ITEM(args, 0)
+                  : nullptr;
+  }
+  static constexpr char kPrefix[] = "maximum recursion depth exceeded";
+  const char* text = message != nullptr && PyUnicode_CheckExact(message)
+                         ? _pystring_to_c_string(message)
+                         : nullptr;
+  return text != nullptr && std::strncmp(text, kPrefix, sizeof kPrefix - 1) == 0;
+}
+
+// The exception being handled now, as an event argument: (type, value, traceback).
+Ref handled_exception_arg() {
+  Ref value = Ref::steal(PyErr_GetHandledException());
+  if (!value || value.is_none())
+    return Ref::steal(Py_BuildValue("(OOO)", Py_None, Py_None, Py_None));
+  Ref tb = Ref::steal(PyException_GetTraceback(value.get()));
+  return Ref::steal(
+      Py_BuildValue("(OOO)", Py_TYPE(value.get()), value.get(), tb ? tb.get() : Py_None));
+}
+
+}  // namespace
 
 int dispatch_exception(PyObject* frame, PyObject* exc_arg) {
   do_dprintf(kDbgFlow, "---EXCEPTION---\n");
@@ -22,37 +152,96 @@ int dispatch_exception(PyObject* frame, PyObject* exc_arg) {
     return 0;
   }
   PyObject* exc_type = PyTuple_GET_ITEM(exc_arg, 0);
-  if (__tracer_stop_here(frame, -1) || stop_at_exception_no_filters(frame, exc_type)) {
+  if (__tracer_stop_here(frame, -1) || stop_at_exception_no_filters(frame, exc_type, exc_arg)) {
     do_dprintf(kDbgFlow, "  dispatched=TRUE\n");
     if (do_exception_callback_if_not_filtered(frame, exc_arg) != 0) {
       do_dprintf(kDbgFlow, "  failure\n");
       return -1;
     }
   }
+  // Whether or not it stopped: the frame's return event needs to know the exception.
+  if (set_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame, exc_arg) != 0) {
+    do_dprintf(kDbgFlow, "  set_frame_exc_info failed\n");
+    PyErr_Clear();
+  }
   return 0;
 }
 
-int stop_at_exception_no_filters(PyObject*, PyObject* exc_type) {
+int stop_at_exception_no_filters(PyObject* frame, PyObject* exc_type, PyObject* exc_arg) {
   do_dprintf(kDbgExceptions, "stop_at_exception_no_filters\n");
-  if (gSelf.exception_mode == kExcAlwaysStop) return 1;
-  if (gSelf.never_stop_excepts &&
-      PyErr_GivenExceptionMatches(exc_type, gSelf.never_stop_excepts.get())) {
+  TracerState& s = gSelf;
+  if (s.exception_mode == kExcAlwaysStop) return 1;
+  if (matches_list(exc_type, s.never_stop_excepts)) {
     do_dprintf(kDbgFlow, "  never stop\n");
     return 0;
+  }
+  if (leaves_bottom_frame(frame)) return 1;
+  // The instance where the event carries one (always, on current interpreters), else the type.
+  PyObject* exc = value_of(exc_arg) != Py_None ? value_of(exc_arg) : exc_type;
+  PyObject* ignored = s.ignored_exception_handlers.get();
+  // The handler analysis and the catch-info list may run Python code (the class expressions
+  // of except clauses, the instances' attributes): the thread enters the debugger first.
+  if (matches_list(exc_type, s.always_stop_excepts)) {
+    enter_debugger();
+    // Only an explicit clause of the raising frame itself lets an always-stop type pass.
+    if (!__tracer_exc_handled(frame, ignored, exc, kMatchGivenExplicit, 1)) {
+      do_dprintf(kDbgFlow, "  always stop\n");
+      return 1;
+    }
+  }
+  if (s.exception_mode == kExcUnhandledStop) {
+    enter_debugger();
+    if (!__tracer_exc_handled(frame, ignored, exc, kMatchGiven, 0)) {
+      do_dprintf(kDbgFlow, "  unhandled\n");
+      return 1;
+    }
+  }
+  if (prints_mode() && (enter_debugger(), frame_prints_exc(&s.exc_data, frame))) {
+    do_dprintf(kDbgFlow, "  frame prints\n");
+    return 1;
   }
   return 0;
 }
 
 int do_exception_callback_if_not_filtered(PyObject* frame, PyObject* exc_arg) {
-  return do_callback(gSelf.exception_cb.get(), frame, exc_arg);
-}
-
-int dispatch_exception_return(PyObject* frame, PyObject*) {
-  if (!compat::is_plain_frame(frame)) return 0;
+  if (!PyTuple_Check(exc_arg) || PyTuple_GET_SIZE(exc_arg) == 0) return 0;
+  enter_debugger();
   ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
   if (data == nullptr) {
     PyErr_Clear();
     return 0;
+  }
+  Ref inner = innermost_frame(frame, exc_arg);
+  if (!inner || !compat::is_plain_frame(inner.get())) return 0;
+  ReportedPlace place;
+  if (!sub_language_place(data, inner.get(), place)) return 0;
+  if (!frame_place(inner.get(), place)) {
+    PyErr_Clear();
+    return 0;
+  }
+  if (filtered(place, inner.get())) return 0;
+  int old_limit = Py_GetRecursionLimit();
+  bool raised = is_recursion_depth_error(exc_arg);
+  if (raised) Py_SetRecursionLimit(old_limit + kRecursionHeadroom);
+  int result = do_callback(gSelf.exception_cb.get(), frame, exc_arg);
+  if (raised) Py_SetRecursionLimit(old_limit);
+  return result != 0 ? -1 : 0;
+}
+
+int dispatch_exception_return(PyObject* frame, PyObject* recorded_exc_arg) {
+  if (!compat::is_plain_frame(frame)) return 0;
+  int result = 0;
+  if (prints_mode() && parent_frame_prints_exc(&gSelf.exc_data, frame)) {
+    enter_debugger();
+    // Held: the callback may drop the record it came from.
+    Ref arg = recorded_exc_arg != nullptr ? Ref::borrow(recorded_exc_arg) : handled_exception_arg();
+    if (!arg) return -1;
+    result = do_exception_callback_if_not_filtered(frame, arg.get());
+  }
+  ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
+  if (data == nullptr) {
+    PyErr_Clear();
+    return result;
   }
   if (data->bot_frame.is(frame)) {
     unsigned long identity = get_thread_ident();
@@ -61,7 +250,7 @@ int dispatch_exception_return(PyObject* frame, PyObject*) {
     call_quit_cb_if_autoquit();
     __clear_should_debug_thread_cache(identity);
   }
-  return 0;
+  return result;
 }
 
 int __tracer_set_pending_exception(ThreadData* data, PyObject* exc) {

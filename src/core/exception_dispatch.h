@@ -7,7 +7,9 @@
 #include "threads/threadops.h"
 
 int dispatch_exception(PyObject* frame, PyObject* exc_arg);
-int stop_at_exception_no_filters(PyObject* frame, PyObject* exc_type);
+// The decision by mode, stop lists and handlers, for an exception of `exc_type` (event
+// argument `exc_arg`) in `frame`: 1 to stop.
+int stop_at_exception_no_filters(PyObject* frame, PyObject* exc_type, PyObject* exc_arg);
 int do_exception_callback_if_not_filtered(PyObject* frame, PyObject* exc_arg);
 int dispatch_exception_return(PyObject* frame, PyObject* recorded_exc_arg);
 

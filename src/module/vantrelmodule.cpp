@@ -9,6 +9,7 @@
 
 #include "core/dispatch.h"
 #include "core/tracercore.h"
+#include "exc/handlers.h"
 #include "module/methods.h"
 #include "support/dbgcommon.h"
 #include "support/dprintf.h"
@@ -287,6 +288,8 @@ PyMODINIT_FUNC PyInit_tvantrel30pydebugstackless(void) {
   if (gModuleSelf == nullptr) return nullptr;
   init_threadops();
   init_tracercore();
+  // Without the interpreter's byte-code tables every exception counts as not caught.
+  if (init_handler_analysis() != 0) do_dprintf(kDbgExceptions, "handler analysis unavailable\n");
   // A forked child is never traced; the handler only sets a flag that the next event reads.
   pthread_atfork(nullptr, nullptr, note_fork_in_child);
   do_dprintf(kDbgFlow, "Initialize vantrel module complete\n");

@@ -1,9 +1,16 @@
-// pycompat.h: everything that differs between the interpreters we support (3.11, 3.12, 3.13).
+// pycompat.h: everything that differs between the interpreters we support (3.11 to 3.15).
 //
 // The rest of the core calls these inline accessors and never tests PY_VERSION_HEX itself.
 // Each accessor says whether it returns a borrowed or a new reference. Private thread-state
-// fields are read here and nowhere else; tests/test_compat.py fails on an interpreter where
-// one of them moved or stopped meaning what we rely on.
+// fields are read here and nowhere else; tests/native/core/test_private_fields.cpp fails on
+// an interpreter where one of them (or the f_trace descriptor, or a code-object field the
+// core reads) moved or stopped meaning what we rely on.
+//
+// 3.14 and 3.15 need no branch of their own: the trace-function protocol, the thread-state
+// fields used here and the frame API behave as on 3.13. What they deprecate is avoided on
+// every version: the current thread state comes from PyThreadState_GetUnchecked from 3.13 on
+// (the old private name warns from 3.14), and nothing here deletes through a frame's locals
+// proxy, whose error changed from TypeError to ValueError in 3.13.x.
 #pragma once
 
 #include <Python.h>
