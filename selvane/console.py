@@ -159,6 +159,8 @@ class Console(cmd.Cmd, Frontend):
             header += f"  [{session.thread_name(stop.thread)}]"
         if stop.reason:
             header += f"  ({stop.reason})"
+        if stop.reason == "interrupted":
+            self.say("")  # past the ^C that the terminal echoed
         self.say(header)
         self.say(f"-> {_source(stop.frame)}")
         for bp in stop.deleted:

@@ -133,6 +133,7 @@ def _execute(session, program, on_start):
         # As the interpreter: the hook prints the traceback (without this frame) and the
         # status is 1.
         tb = error.__traceback__.tb_next if error.__traceback__ is not None else None
+        error.__traceback__ = tb  # newer hooks read the traceback from the exception
         try:
             sys.excepthook(type(error), error, tb)
         except BaseException:

@@ -266,8 +266,8 @@ class Session:
         if self._is_internal(stop.frame):
             # The debugger's own frames: step through them to the program while starting,
             # run freely once the program is under way (it has ended, or it is a thread).
-            if seeking:
-                core.step_into()
+            if seeking or ident in self._stop_requested:
+                core.step_into()  # on to the program's next line
             else:
                 core.continue_run()
             return
