@@ -10,6 +10,11 @@ import threading
 
 import tvantrel30pydebugstackless as core
 
+# The interpreter's type attribute cache keeps the last name looked up in each slot: a lookup
+# by a C string leaves a fresh name object there until another lookup evicts it. Emptied
+# before each reading, so that the totals show only what the core itself still holds.
+_clear_interpreter_caches = getattr(sys, "_clear_internal_caches", None) or sys._clear_type_cache
+
 stops = []
 
 
@@ -72,6 +77,7 @@ def main(cycles):
     for i in range(cycles):
         cycle()
         stops.clear()
+        _clear_interpreter_caches()
         gc.collect()
         totals[i] = sys.gettotalrefcount()
     for total in totals:

@@ -97,7 +97,7 @@ INIT_GROWTH = 9 if sys.version_info < (3, 12) else 8
 def test_repeated_init_grows_by_the_nine_overwritten_references():
     # Nothing but the stored references may grow; which objects they are is checked too, so
     # that a missing reference cannot hide behind an extra one elsewhere.
-    held = (noop, __import__, MODULES)
+    held = (noop, ORIGINAL_IMPORT, MODULES)
     before = [sys.getrefcount(obj) for obj in held]
     core.init(*ARGS)
     after = [sys.getrefcount(obj) for obj in held]
@@ -210,5 +210,17 @@ def test_concurrent_lifecycle_rounds_leave_the_total_flat():
     assert lines[-4:-2] == ["threads", "0"]
     assert int(lines[-1]) > 1000  # the threads really stepped
     totals = [int(x) for x in lines[:-4]]
+    assert len(totals) == 5
+    assert totals[1:] == [totals[0]] * 4, totals
+
+
+@needs_debug
+def test_exception_rounds_in_every_mode_leave_the_total_flat():
+    # Raises caught in the same frame, further out, by loops and generators, frames left by
+    # exceptions (their records), a RecursionError, in modes 0, 1, 2, 4 and 5 with every
+    # exception setting in force: frames, tracebacks and records all go back.
+    out = subprocess.run([sys.executable, os.path.join(HERE, "refcount_exceptions.py"), "5"],
+                         capture_output=True, text=True, timeout=300, check=True).stdout
+    totals = [int(x) for x in out.split()]
     assert len(totals) == 5
     assert totals[1:] == [totals[0]] * 4, totals

@@ -62,19 +62,19 @@ void reset_exc_data(ExcData* data) {
 Py_ssize_t ref_count_in_tb(PyObject* traceback, PyObject* frame) {
   Py_ssize_t count = 0;
   int visited = 0;
-  for (Ref tb = Ref::borrow(traceback); tb && !tb.is_none();) {
+  // The traceback's own fields: no attribute lookup (and no name object) per entry, and no
+  // code runs, so the chain cannot change under the walk.
+  for (PyObject* tb = traceback; tb != nullptr && PyTraceBack_Check(tb);
+       tb = reinterpret_cast<PyObject*>(reinterpret_cast<PyTracebackObject*>(tb)->tb_next)) {
     if (++visited > kTracebackWalkLimit) return 0;
-    Ref tb_frame = Ref::steal(PyObject_GetAttrString(tb.get(), "tb_frame"));
+    PyObject* tb_frame =
+        reinterpret_cast<PyObject*>(reinterpret_cast<PyTracebackObject*>(tb)->tb_frame);
     // Counted once per entry whose back chain passes the frame: an estimate, on purpose.
-    for (Ref f = tb_frame; f && compat::is_plain_frame(f.get());
+    for (Ref f = Ref::borrow(tb_frame); f && compat::is_plain_frame(f.get());
          f = compat::frame_back(reinterpret_cast<PyFrameObject*>(f.get()))) {
       if (f.is(frame)) ++count;
     }
-    Ref next = Ref::steal(PyObject_GetAttrString(tb.get(), "tb_next"));
-    if (!next) PyErr_Clear();
-    tb = next;
   }
-  if (PyErr_Occurred() != nullptr) PyErr_Clear();
   return count;
 }
 

@@ -7,7 +7,9 @@
 // not catch, the entry covering the handler's own first instruction is the next one outward.
 // Only user `except` clauses, a bare `except:` and the end of an `async for` catch; `finally`
 // bodies, `with` exits and the compiler's cleanup handlers neither catch nor end the search.
-// Shapes that are not understood count as not catching.
+// Shapes that are not understood count as not catching, and so do class expressions that
+// call, read a closure cell, or raise when evaluated. `except*` clauses catch when together
+// they take all of the exception (every member of a group, or a plain exception).
 //
 // The analysis reads the de-optimised copy of the byte code (co_code), with the vocabulary of
 // the running interpreter (exc/opcodes.h). It does not depend on how the exception was

@@ -58,15 +58,28 @@ constexpr Op kRequired[] = {kCache,      kExtendedArg,   kPopTop,    kPushExcInf
                             kBuildTuple};
 
 // opmap[name] as an opcode number, or kAbsent (pseudo opcodes, >= 256, never reach co_code).
-int opcode_number(PyObject* opmap, const char* name) {
-  PyObject* value = PyDict_GetItemString(opmap, name);  // borrowed
-  if (value == nullptr || !PyLong_Check(value)) return kAbsent;
-  long number = PyLong_AsLong(value);
+// opmap is a dict up to 3.14 and a frozendict (no dict subclass) in 3.15: read it as a mapping.
+int opcode_number(PyObject* opmap, PyObject* name) {
+  Ref value = Ref::steal(PyObject_GetItem(opmap, name));
+  if (!value || !PyLong_Check(value.get())) {
+    PyErr_Clear();
+    return kAbsent;
+  }
+  long number = PyLong_AsLong(value.get());
   if (number < 0 || number > 255) {
     PyErr_Clear();
     return kAbsent;
   }
   return static_cast<int>(number);
+}
+
+int opcode_number(PyObject* opmap, const char* name) {
+  Ref key = Ref::steal(PyUnicode_FromString(name));
+  if (!key) {
+    PyErr_Clear();
+    return kAbsent;
+  }
+  return opcode_number(opmap, key.get());
 }
 
 int opcode_by_alternatives(PyObject* opmap, const char* names) {
@@ -113,11 +126,8 @@ bool read_cache_sizes(PyObject* opcode_module, PyObject* opmap, Opcodes* table) 
     long count = PyLong_AsLong(PyTuple_GET_ITEM(pair, 1));
     if (count < 0 || count > 255) return false;
     if (!PyUnicode_Check(name)) return false;
-    PyObject* number = PyDict_GetItem(opmap, name);  // borrowed
-    if (number == nullptr) continue;                  // a specialised or pseudo name
-    long op = PyLong_AsLong(number);
-    if (op >= 0 && op < 256) table->caches[op] = static_cast<uint8_t>(count);
-    PyErr_Clear();
+    int op = opcode_number(opmap, name);  // kAbsent for specialised or pseudo names
+    if (op != kAbsent) table->caches[op] = static_cast<uint8_t>(count);
   }
   return true;
 }
@@ -206,7 +216,7 @@ bool load_table(Opcodes* table) {
   Ref opcode_module = Ref::steal(PyImport_ImportModule("opcode"));
   if (!opcode_module) return false;
   Ref opmap = Ref::steal(PyObject_GetAttrString(opcode_module.get(), "opmap"));
-  if (!opmap || !PyDict_Check(opmap.get())) return false;
+  if (!opmap || !PyMapping_Check(opmap.get())) return false;
   for (int role = 0; role < kOpCount; ++role) {
     table->op[role] = opcode_by_alternatives(opmap.get(), kOpNames[role]);
   }

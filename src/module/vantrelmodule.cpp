@@ -288,8 +288,9 @@ PyMODINIT_FUNC PyInit_tvantrel30pydebugstackless(void) {
   if (gModuleSelf == nullptr) return nullptr;
   init_threadops();
   init_tracercore();
-  // Without the interpreter's byte-code tables every exception counts as not caught.
-  if (init_handler_analysis() != 0) do_dprintf(kDbgExceptions, "handler analysis unavailable\n");
+  // The handler analysis reads the interpreter's opcode tables now, never inside an event;
+  // when they cannot be read it answers "not caught" everywhere.
+  init_handler_analysis();
   // A forked child is never traced; the handler only sets a flag that the next event reads.
   pthread_atfork(nullptr, nullptr, note_fork_in_child);
   do_dprintf(kDbgFlow, "Initialize vantrel module complete\n");
