@@ -146,15 +146,17 @@ def _next(instructions, i, opname, stop_at=()):
     return None
 
 
-def find_handler(frame, exc_type, ignored_codes=()):
+def find_handler(frame, exc_type, boundary_codes=()):
     """The first frame from `frame` outward whose active handler catches `exc_type`, or None.
-    Frames running one of `ignored_codes` do not count as catching."""
+    A frame running one of `boundary_codes` (the debugger's runner, a thread's start-up
+    code) is the edge of the program: an exception that reaches it is not caught."""
     while frame is not None:
-        if frame.f_code not in ignored_codes:
-            try:
-                if frame_catches(frame, exc_type, frame.f_lasti):
-                    return frame
-            except Exception:  # never let the prediction disturb a stop
-                return None
+        if frame.f_code in boundary_codes:
+            return None
+        try:
+            if frame_catches(frame, exc_type, frame.f_lasti):
+                return frame
+        except Exception:  # never let the prediction disturb a stop
+            return None
         frame = frame.f_back
     return None
