@@ -302,3 +302,89 @@ def test_the_example_program_under_the_debugger(tmp_path):
     finally:
         dbg.close()
 
+
+
+def test_ctrl_c_stops_a_busy_thread_while_main_waits(tmp_path):
+    write(tmp_path, "prog.py", """
+        import threading
+
+        state = {"running": True, "count": 0}
+
+
+        def spin():
+            while state["running"]:
+                state["count"] += 1
+
+
+        worker = threading.Thread(target=spin, name="spinner")
+        worker.start()
+        worker.join()
+        print("joined", state["count"] > 0)
+    """)
+    dbg = Session.debug(tmp_path, "prog.py")
+    try:
+        dbg.prompt()
+        dbg.child.sendline("c")
+        time.sleep(0.5)
+        dbg.child.sendintr()
+        out = dbg.prompt()
+        # The main thread sits in join(): the idle callback stops the spinning thread.
+        assert "[spinner]  (interrupted)" in stop_line(out)
+        assert "in spin()" in stop_line(out)
+        assert dbg.do("state['running'] = False") == ""
+        out, status = dbg.finish("c")
+        assert "joined True" in out
+        assert status == 0
+    finally:
+        dbg.close()
+
+
+def test_skip_thread_option(tmp_path):
+    write(tmp_path, "prog.py", """
+        import threading
+
+
+        def work(results):
+            results.append(len(results))
+
+
+        results = []
+        threads = [threading.Thread(target=work, args=(results,), name=name)
+                   for name in ("skipped-1", "kept")]
+        for thread in threads:
+            thread.start()
+            thread.join()
+        print("results", results)
+    """)
+    dbg = Session.debug(tmp_path, "--skip-thread", "skipped-*", "--break", "prog.py:5",
+                        "prog.py")
+    try:
+        dbg.prompt()
+        out = dbg.do("c")
+        assert stop_line(out) == "> prog.py:5 in work()  [kept]  (breakpoint 1)"
+        assert dbg.do("p results") == "[0]\n"
+        out, status = dbg.finish("c")
+        assert "results [0, 1]" in out and status == 0
+    finally:
+        dbg.close()
+
+
+def test_completion_of_commands_files_and_names(tmp_path):
+    write(tmp_path, "prog.py", """
+        total_value = 3
+        print(total_value)
+    """)
+    dbg = Session.debug(tmp_path, "prog.py")
+    try:
+        dbg.prompt()
+        dbg.child.send("n\n")
+        dbg.prompt()
+        dbg.child.send("longl\t\n")
+        assert "   2  ->" in dbg.prompt()
+        dbg.child.send("p total_v\t\n")
+        assert "3\n" in dbg.prompt()
+        dbg.child.send("break prog.\t2\n")
+        assert "Breakpoint 1 at prog.py:2" in dbg.prompt()
+        dbg.finish("c")
+    finally:
+        dbg.close()
