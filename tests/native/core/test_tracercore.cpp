@@ -27,6 +27,9 @@ def exception_cb(frame, exc, changed): pass
 def quit_cb(): pass
 def trace_dispatch(frame, event, arg): return trace_dispatch
 default_import = builtins.__import__
+# init puts the module's __import__ into the builtins: this one hands every import on.
+def import_hook(*args, **kwargs):
+    return default_import(*args, **kwargs)
 debug_file = io.StringIO()
 internal_modules = {}
 )";
@@ -39,6 +42,7 @@ class TracerCoreTest : public coretest::TracerStateTest {
     module_ = Ref::steal(PyModule_New("core_test_module"));
     ASSERT_TRUE(module_);
     ASSERT_EQ(PyObject_SetAttrString(module_.get(), "trace_dispatch", cb("trace_dispatch")), 0);
+    ASSERT_EQ(PyObject_SetAttrString(module_.get(), "__import__", cb("import_hook")), 0);
   }
   void TearDown() override {
     set_dprintf_file(nullptr);
@@ -133,7 +137,7 @@ TEST_F(TracerCoreTest, InitRestoresTheDefaults) {
   EXPECT_FALSE(gSelf.spare_ref);
   EXPECT_FALSE(gSelf.always_stop_excepts);
   EXPECT_FALSE(gSelf.debug_thread_cb);
-  EXPECT_FALSE(gSelf.installed_import_hook);
+  EXPECT_TRUE(gSelf.installed_import_hook.is(cb("import_hook")));  // installed anew
   ASSERT_TRUE(gSelf.new_imports);
   EXPECT_TRUE(PyList_CheckExact(gSelf.new_imports.get()));
   EXPECT_EQ(PyList_GET_SIZE(gSelf.new_imports.get()), 0);
