@@ -16,6 +16,7 @@ import os
 import pprint
 import reprlib
 import sys
+import threading
 
 from .session import Frontend, Session, SessionError, _own_files, _show_path
 
@@ -172,8 +173,12 @@ class Console(cmd.Cmd, Frontend):
             self.say(f"!! {_exception_text(exc_type, value)}")
             if stop.handler is not None:
                 self.say(f"   (will be caught in {self._where(stop.handler)})")
-            else:
+            elif self.session.prints_exceptions(stop.frame):
+                self.say("   (caught here and printed)")
+            elif stop.thread == threading.main_thread().ident:
                 self.say("   (not caught: the program ends with it)")
+            else:
+                self.say("   (not caught: the thread ends with it)")
 
     def _where(self, frame):
         return f"{_show_path(frame.f_code.co_filename)}:{frame.f_lineno} in " \

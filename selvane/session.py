@@ -620,6 +620,19 @@ class Session:
             types.append(value)
         return tuple(types)
 
+    def prints_exceptions(self, frame):
+        """Whether the frame runs a function of the catch-info list that prints what it
+        catches (where the "printed" mode stops)."""
+        if core.get_exception_mode() not in (4, 5):
+            return False
+        code = frame.f_code
+        module = frame.f_globals.get("__name__")
+        for info in self.catch_info:
+            if info.co_name == code.co_name and info.mod_name in ("*", module) \
+                    and info.prints and not info.parent:
+                return True
+        return False
+
     def set_always_stop(self, names):
         core.set_always_stop_excepts(self._exception_types(names))
 

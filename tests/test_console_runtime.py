@@ -178,7 +178,7 @@ def test_exception_escaping_a_thread_is_unhandled(tmp_path):
         out = dbg.do("c")
         assert stop_line(out) == "> prog.py:6 in worker()  [failing]"
         assert "!! KeyError: 'missing'" in out
-        assert "(not caught: the program ends with it)" in out
+        assert "(not caught: the thread ends with it)" in out
         out, status = dbg.finish("c")
         assert "main goes on" in out
         assert "Exception in thread failing" in out
@@ -386,5 +386,39 @@ def test_completion_of_commands_files_and_names(tmp_path):
         dbg.child.send("break prog.\t2\n")
         assert "Breakpoint 1 at prog.py:2" in dbg.prompt()
         dbg.finish("c")
+    finally:
+        dbg.close()
+
+
+def test_printed_mode_stops_where_the_library_prints(tmp_path):
+    write(tmp_path, "prog.py", """
+        import threading
+
+
+        def worker():
+            try:
+                {}["caught"]
+            except KeyError:
+                pass
+            return {}["missing"]
+
+
+        thread = threading.Thread(target=worker, name="failing")
+        thread.start()
+        thread.join()
+        print("main goes on")
+    """)
+    dbg = Session.debug(tmp_path, "--exceptions", "printed", "prog.py")
+    try:
+        dbg.prompt()
+        out = dbg.do("c")
+        # Not at the caught KeyError; at the thread start-up code that prints the other.
+        assert "in _bootstrap_inner()  [failing]" in stop_line(out)
+        assert "!! KeyError: 'missing'" in out
+        assert "(caught here and printed)" in out
+        assert dbg.do("catch").startswith("exceptions stop: printed")
+        out, status = dbg.finish("c")
+        assert "Exception in thread failing" in out and "main goes on" in out
+        assert status == 0
     finally:
         dbg.close()
