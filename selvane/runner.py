@@ -5,6 +5,7 @@ with. The frames of this module stay out of the person's view (they are the debu
 and their handlers do not count as catching the program's exceptions.
 """
 
+import builtins
 import importlib.machinery
 import io
 import os
@@ -84,15 +85,12 @@ class Program:
         """Makes the program's view of the interpreter: __main__, sys.argv, sys.path[0]."""
         module = types.ModuleType("__main__")
         module.__dict__.update(self.globals)
-        module.__builtins__ = __builtins__ if isinstance(__builtins__, dict) else \
-            vars(__builtins__)
+        module.__builtins__ = builtins  # the module, as in the interpreter's own __main__
         self.globals = module.__dict__
         sys.modules["__main__"] = module
         sys.argv = [self.argv0] + self.args
-        if sys.path and not self.is_module and sys.path[0] == os.getcwd():
-            sys.path[0] = self.path0  # `python -m selvane` put the working directory there
-        elif sys.path and self.is_module:
-            sys.path[0] = self.path0
+        if sys.path:
+            sys.path[0] = self.path0  # where `python -m selvane` put its own directory
         else:
             sys.path.insert(0, self.path0)
         return module

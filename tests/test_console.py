@@ -368,23 +368,27 @@ def test_program_reading_standard_input(tmp_path):
         dbg.close()
 
 
-def test_output_and_exit_status_unchanged(tmp_path):
-    program = write(tmp_path, "prog.py", """
-        import sys
-        print("to stdout", sys.argv[1:])
+@pytest.mark.parametrize("ending", ["sys.exit(4)", "raise_it()"])
+def test_output_and_exit_status_unchanged(tmp_path, ending):
+    program = write(tmp_path, "prog.py", f"""
+        import __main__, sys
+        def raise_it():
+            raise LookupError("the end")
+        print("to stdout", sys.argv[1:], __name__, __main__.__builtins__, __file__)
+        print("main", sorted(vars(__main__)), __main__.__spec__, __main__.__package__)
         print("to stderr", file=sys.stderr)
         sys.stdout.write("no newline at the end")
-        sys.exit(4)
+        {ending}
     """)
     plain = subprocess.run([sys.executable, str(program), "a"], capture_output=True,
                            text=True, cwd=tmp_path, timeout=30)
-    dbg = Session(None, tmp_path, shell=f"{sys.executable} -m selvane -c continue prog.py a "
-                  "> out.txt 2> err.txt")
+    dbg = Session(None, tmp_path, shell=f"{sys.executable} -m selvane --exceptions never "
+                  "-c continue prog.py a > out.txt 2> err.txt")
     try:
         _out, status = dbg.finish()
     finally:
         dbg.close()
-    assert status == plain.returncode == 4
+    assert status == plain.returncode == (4 if "exit" in ending else 1)
     assert (tmp_path / "out.txt").read_text() == plain.stdout
     assert (tmp_path / "err.txt").read_text() == plain.stderr
 
