@@ -275,11 +275,11 @@ class Session:
         self._stop_requested.discard(ident)
         last = self._last_resume.get(ident)
         if stop.kind == "exception":
-            exc_id = id(stop.exc[1])
-            if last == "continue_run" and exc_id == self._reported_exc:
-                core.continue_run()  # the same exception on its way out: shown once
+            if last == "continue_run" and self._propagating(stop):
+                core.continue_run()  # the exception shown already, on its way out
                 return
-            self._reported_exc = exc_id
+            # Ids only: holding the objects would change when the program's objects die.
+            self._reported_exc = (id(stop.exc[1]), id(stop.frame))
             self._predict(stop)
         elif interrupted and last == "continue_run" and hit is None:
             if not self._interrupt_pending:
@@ -293,6 +293,21 @@ class Session:
         self._seeking_first_stop = False
         self._first_stop = None
         self._answer(stop)
+
+    def _propagating(self, stop):
+        """Whether this exception event is the last one shown, reported again by a caller
+        as it unwinds (and not a new exception, which may reuse the old one's memory)."""
+        if self._reported_exc is None:
+            return False
+        value_id, frame_id = self._reported_exc
+        if id(stop.exc[1]) != value_id or id(stop.frame) == frame_id:
+            return False
+        tb = stop.exc[2]
+        while tb is not None:
+            if id(tb.tb_frame) == frame_id:
+                return True
+            tb = tb.tb_next
+        return False
 
     def _answer(self, stop):
         self.stop = stop

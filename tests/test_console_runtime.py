@@ -422,3 +422,35 @@ def test_printed_mode_stops_where_the_library_prints(tmp_path):
         assert status == 0
     finally:
         dbg.close()
+
+
+def test_always_mode_stops_at_each_new_exception(tmp_path):
+    write(tmp_path, "prog.py", """
+        def check(i):
+            if i % 2:
+                raise ValueError(i)
+            return i
+
+
+        kept = []
+        for i in range(5):
+            try:
+                kept.append(check(i))
+            except ValueError:
+                pass
+        print("kept", kept)
+    """)
+    dbg = Session.debug(tmp_path, "--exceptions", "always", "prog.py")
+    try:
+        dbg.prompt()
+        for expected in ("1", "3"):
+            out = dbg.do("c")
+            assert stop_line(out) == "> prog.py:3 in check()"
+            assert f"!! ValueError: {expected}" in out
+            assert "(will be caught in prog.py:10 in <module>())" in out
+            # Each new exception stops (even where it reuses the memory of the last); the
+            # one shown does not stop again in each caller on its way out.
+        out, status = dbg.finish("c")
+        assert "kept [0, 2, 4]" in out and status == 0
+    finally:
+        dbg.close()
