@@ -97,11 +97,11 @@ def main(argv=None):
                       debug_all_threads=not options.one_thread,
                       skip_threads=options.skip_thread)
     session.main_file = program.file
-    for spec in options.breaks:
+    for location in options.breaks:
         try:
-            bp = session.add_breakpoint(spec)
+            bp = session.add_breakpoint(location)
         except SessionError as error:
-            print(f"python -m selvane: --break {spec}: {error}", file=sys.stderr)
+            print(f"python -m selvane: --break {location}: {error}", file=sys.stderr)
             return 2
         console.say(f"Breakpoint {bp.number} at {os.path.relpath(bp.file)}:{bp.line}")
 

@@ -66,7 +66,7 @@ class Program:
         self.path0 = os.getcwd()
         sys.path.insert(0, self.path0)
         try:
-            name, spec, code = runpy._get_module_details(self.target)
+            name, module_found, code = runpy._get_module_details(self.target)
         except ImportError as error:
             raise ProgramError(f"{error}", 1) from None
         except SyntaxError as error:
@@ -74,12 +74,13 @@ class Program:
         finally:
             sys.path.pop(0)
         self.code = code
-        self.file = spec.origin
-        self.argv0 = spec.origin
-        self.globals = {"__name__": "__main__", "__doc__": None, "__package__": spec.parent,
-                        "__loader__": spec.loader, "__spec__": spec,
-                        "__annotations__": {}, "__file__": spec.origin,
-                        "__cached__": spec.cached}
+        self.file = module_found.origin
+        self.argv0 = module_found.origin
+        self.globals = {"__name__": "__main__", "__doc__": None,
+                        "__package__": module_found.parent,
+                        "__loader__": module_found.loader, "__spec__": module_found,
+                        "__annotations__": {}, "__file__": module_found.origin,
+                        "__cached__": module_found.cached}
 
     def install(self):
         """Makes the program's view of the interpreter: __main__, sys.argv, sys.path[0]."""

@@ -503,12 +503,12 @@ class Session:
                 return os.path.abspath(path)
         raise SessionError(f"no file {name!r}")
 
-    def parse_location(self, spec):
+    def parse_location(self, location):
         """`[FILE:]LINE` or a function name -> (file, line)."""
-        spec = spec.strip()
-        if not spec:
+        location = location.strip()
+        if not location:
             raise SessionError("a location is needed: [FILE:]LINE or FUNCTION")
-        file, _, line = spec.rpartition(":")
+        file, _, line = location.rpartition(":")
         if line.strip().isdigit():
             if file:
                 path = self.resolve_file(file.strip())
@@ -519,9 +519,9 @@ class Session:
             else:
                 raise SessionError("no current file: give FILE:LINE")
             return path, int(line)
-        if ":" in spec:
-            raise SessionError(f"bad location {spec!r}: expected [FILE:]LINE or FUNCTION")
-        return self._function_location(spec)
+        if ":" in location:
+            raise SessionError(f"bad location {location!r}: expected [FILE:]LINE or FUNCTION")
+        return self._function_location(location)
 
     main_file = None
 
@@ -542,8 +542,8 @@ class Session:
                        if line is not None and line > code.co_firstlineno)
         return os.path.abspath(code.co_filename), (lines[0] if lines else code.co_firstlineno)
 
-    def add_breakpoint(self, spec, condition=None, temporary=False):
-        path, line = self.parse_location(spec)
+    def add_breakpoint(self, location, condition=None, temporary=False):
+        path, line = self.parse_location(location)
         source = linecache.getline(path, line)
         if not source:
             raise SessionError(f"{_show_path(path)} has no line {line}")
