@@ -15,6 +15,11 @@ import threading
 import types
 
 
+# Before 3.14 the interpreter's __main__ starts with an empty __annotations__; from 3.14 on
+# annotations are made lazily and __main__ has none to begin with.
+_MAIN_ANNOTATIONS = {"__annotations__": {}} if sys.version_info < (3, 14) else {}
+
+
 class ProgramError(Exception):
     """The program cannot be started (no such file or module, a syntax error); the text is
     what the interpreter would have said."""
@@ -57,8 +62,8 @@ class Program:
         self.argv0 = self.target
         self.globals = {"__name__": "__main__", "__doc__": None, "__package__": None,
                         "__loader__": importlib.machinery.SourceFileLoader("__main__", path),
-                        "__spec__": None, "__annotations__": {}, "__file__": path,
-                        "__cached__": None}
+                        "__spec__": None, "__file__": path, "__cached__": None,
+                        **_MAIN_ANNOTATIONS}
 
     def _prepare_module(self):
         # As `python -m`: the current directory comes first on the path while the module is
@@ -79,8 +84,8 @@ class Program:
         self.globals = {"__name__": "__main__", "__doc__": None,
                         "__package__": module_found.parent,
                         "__loader__": module_found.loader, "__spec__": module_found,
-                        "__annotations__": {}, "__file__": module_found.origin,
-                        "__cached__": module_found.cached}
+                        "__file__": module_found.origin, "__cached__": module_found.cached,
+                        **_MAIN_ANNOTATIONS}
 
     def install(self):
         """Makes the program's view of the interpreter: __main__, sys.argv, sys.path[0]."""

@@ -257,8 +257,8 @@ def test_ctrl_c_stops_a_running_loop(tmp_path):
         dbg.child.sendintr()
         out = dbg.prompt()
         assert "(interrupted)" in stop_line(out)
-        assert "prog.py:5 in <module>()" in stop_line(out) or \
-            "prog.py:6 in <module>()" in stop_line(out)
+        assert "prog.py:4 in <module>()" in stop_line(out) or \
+            "prog.py:5 in <module>()" in stop_line(out)
         assert "KeyboardInterrupt" not in out
         assert dbg.do("running = False") == ""
         out, status = dbg.finish("c")
