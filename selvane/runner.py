@@ -15,9 +15,16 @@ import threading
 import types
 
 
-# Before 3.14 the interpreter's __main__ starts with an empty __annotations__; from 3.14 on
-# annotations are made lazily and __main__ has none to begin with.
-_MAIN_ANNOTATIONS = {"__annotations__": {}} if sys.version_info < (3, 14) else {}
+def _main_extras(cached):
+    """The names of the interpreter's own __main__ that come and go with the version: an
+    empty __annotations__ before 3.14 (annotations are made lazily since), __cached__
+    before 3.15."""
+    extras = {}
+    if sys.version_info < (3, 14):
+        extras["__annotations__"] = {}
+    if sys.version_info < (3, 15):
+        extras["__cached__"] = cached
+    return extras
 
 
 class ProgramError(Exception):
@@ -62,8 +69,8 @@ class Program:
         self.argv0 = self.target
         self.globals = {"__name__": "__main__", "__doc__": None, "__package__": None,
                         "__loader__": importlib.machinery.SourceFileLoader("__main__", path),
-                        "__spec__": None, "__file__": path, "__cached__": None,
-                        **_MAIN_ANNOTATIONS}
+                        "__spec__": None, "__file__": path,
+                        **_main_extras(None)}
 
     def _prepare_module(self):
         # As `python -m`: the current directory comes first on the path while the module is
@@ -84,8 +91,8 @@ class Program:
         self.globals = {"__name__": "__main__", "__doc__": None,
                         "__package__": module_found.parent,
                         "__loader__": module_found.loader, "__spec__": module_found,
-                        "__file__": module_found.origin, "__cached__": module_found.cached,
-                        **_MAIN_ANNOTATIONS}
+                        "__file__": module_found.origin,
+                        **_main_extras(module_found.cached)}
 
     def install(self):
         """Makes the program's view of the interpreter: __main__, sys.argv, sys.path[0]."""
