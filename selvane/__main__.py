@@ -1,58 +1,120 @@
-"""Entry point of ``python -m selvane``.
+"""``python -m selvane [options] script.py [args...]`` and
+``python -m selvane [options] -m module [args...]``: run a program under the console
+debugger. It stops before the program's first line and shows a prompt; `help` lists the
+commands."""
 
-The console debugger is not written yet. Until it is, this entry loads the native core,
-initialises it, traces the given script with a recording server side that steps into every
-line, and prints what the core answered: enough to see the core work on a real program.
-"""
-
+import argparse
 import os
-import runpy
 import sys
 
-import tvantrel30pydebugstackless as core
+USAGE = "python -m selvane [options] (script.py | -m module) [args...]"
 
 
-class _Recorder:
-    def __init__(self, script):
-        self.script = os.path.abspath(script)
-        self.lines = 0
+def _parser():
+    parser = argparse.ArgumentParser(
+        prog="python -m selvane", usage=USAGE,
+        description="Run a Python program under the selvane console debugger. The program "
+                    "stops before its first line; type `help` at the prompt for the "
+                    "commands.")
+    parser.add_argument("-c", "--command", action="append", default=[], metavar="COMMAND",
+                        help="a debugger command to run at the first stop (repeatable)")
+    parser.add_argument("-m", dest="module", metavar="MODULE",
+                        help="run a library module as a script, as `python -m` does")
+    parser.add_argument("--break", dest="breaks", action="append", default=[],
+                        metavar="FILE:LINE", help="set a breakpoint before the program runs "
+                        "(repeatable)")
+    parser.add_argument("--exceptions", choices=("never", "always", "unhandled", "printed"),
+                        default="unhandled",
+                        help="which exceptions stop the program (default: unhandled; "
+                        "printed: where the standard library catches and prints them)")
+    parser.add_argument("--no-autoquit", action="store_true",
+                        help="keep tracing after a thread's outermost frame returns")
+    parser.add_argument("--one-thread", action="store_true",
+                        help="while one thread is stopped, run the others untraced instead "
+                        "of holding them")
+    parser.add_argument("--skip-thread", action="append", default=[], metavar="PATTERN",
+                        help="do not debug threads whose name matches this pattern "
+                        "(repeatable)")
+    parser.add_argument("--no-stop-at-start", action="store_true",
+                        help="run to the first breakpoint instead of stopping before the "
+                        "first line")
+    parser.add_argument("script", nargs="?", help="the program to debug")
+    parser.add_argument("args", nargs=argparse.REMAINDER, help="the program's arguments")
+    return parser
 
-    def line_cb(self, frame, changed):
-        if frame.f_code.co_filename == self.script:
-            self.lines += 1
-            print(f"selvane: line {frame.f_lineno:4d} in {frame.f_code.co_name}", file=sys.stderr)
-        core.step_into()
 
-    def return_cb(self, frame, value, changed):
-        core.step_into()
+def _split(argv):
+    """Options are ours up to the script (or -m MODULE); everything after is the program's."""
+    ours = []
+    i = 0
+    takes_value = {"-c", "--command", "--break", "--exceptions", "--skip-thread"}
+    while i < len(argv):
+        arg = argv[i]
+        if arg == "-m":
+            if i + 1 >= len(argv):
+                return ours + [arg], None, []
+            return ours, ("module", argv[i + 1]), argv[i + 2:]
+        if arg == "--":
+            if i + 1 >= len(argv):
+                return ours, None, []
+            return ours, ("script", argv[i + 1]), argv[i + 2:]
+        if arg.startswith("-") and arg != "-":
+            ours.append(arg)
+            if arg in takes_value and i + 1 < len(argv):
+                ours.append(argv[i + 1])
+                i += 1
+            i += 1
+            continue
+        return ours, ("script", arg), argv[i + 1:]
+    return ours, None, []
 
-    def exception_cb(self, frame, exc, changed):
-        core.step_into()
 
-
-def main(argv):
-    if len(argv) != 1:
-        print("usage: python -m selvane script.py", file=sys.stderr)
+def main(argv=None):
+    argv = sys.argv[1:] if argv is None else argv
+    parser = _parser()
+    ours, target, program_args = _split(argv)
+    options = parser.parse_args(ours)
+    if target is None:
+        parser.print_usage(sys.stderr)
+        print("python -m selvane: error: a script or -m MODULE is needed", file=sys.stderr)
         return 2
-    script = os.path.abspath(argv[0])
-    recorder = _Recorder(script)
-    core.init(0.0, 0, lambda flag: None, lambda: None, recorder.line_cb, recorder.return_cb,
-              recorder.exception_cb, lambda: None, None, __import__, None, {})
-    print(f"selvane: core loaded, tracing active: {core.get_tracing()}", file=sys.stderr)
-    sys.argv = [script]
-    core.step_into()
-    core.start_trace()
+
+    from .console import Console, Terminal
+    from .runner import Program, ProgramError, run
+    from .session import Session, SessionError
+
+    program = Program(target[1], program_args, is_module=target[0] == "module")
     try:
-        runpy.run_path(script, run_name="__main__")
-    finally:
-        core.stop_trace()
-        threads = core.get_threads()
-        print(f"selvane: stopped on {recorder.lines} lines of {script}; "
-              f"threads seen: {len(threads)}; tracing active: {core.get_tracing()}",
-              file=sys.stderr)
-        core.reset()
-    return 0
+        program.prepare()
+    except ProgramError as error:
+        print(f"python -m selvane: {error}", file=sys.stderr)
+        return error.status
+
+    terminal = Terminal.open()
+    console = Console(terminal, commands=options.command)
+    session = Session(console, exceptions=options.exceptions,
+                      autoquit=not options.no_autoquit,
+                      debug_all_threads=not options.one_thread,
+                      skip_threads=options.skip_thread)
+    session.main_file = program.file
+    for location in options.breaks:
+        try:
+            bp = session.add_breakpoint(location)
+        except SessionError as error:
+            print(f"python -m selvane: --break {location}: {error}", file=sys.stderr)
+            return 2
+        console.say(f"Breakpoint {bp.number} at {os.path.relpath(bp.file)}:{bp.line}")
+
+    def on_start():
+        session.program_started()
+        session.start(stop_at_first_line=not options.no_stop_at_start,
+                      first_stop=lambda frame: frame.f_code is program.code)
+
+    status = run(session, program, on_start)
+    session.finish()
+    console.say(f"The program exited with status {status}.")
+    return status
 
 
 if __name__ == "__main__":
-    sys.exit(main(sys.argv[1:]))
+    sys.exit(main())

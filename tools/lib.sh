@@ -61,10 +61,13 @@ ensure_venv() {  # name -> path of the venv's python (in $SELVANE_VENVS if set n
   if [ ! -x "$venv/bin/python" ]; then
     "$python" -m venv "$venv" >&2
   fi
-  if [ ! -f "$venv/.tools-installed" ]; then
-    pip_quietly "$venv/bin/python" install -q --disable-pip-version-check \
-      "scikit-build-core>=0.8" cmake ninja "pytest>=7" >&2 || return 1
-    touch "$venv/.tools-installed"
+  # The marker holds the list installed, so that a venv made before a tool joined the list
+  # gets it on the next run.
+  local tools=("scikit-build-core>=0.8" cmake ninja "pytest>=7" "pexpect>=4.8")
+  if [ "$(cat "$venv/.tools-installed" 2>/dev/null)" != "${tools[*]}" ]; then
+    pip_quietly "$venv/bin/python" install -q --disable-pip-version-check "${tools[@]}" >&2 \
+      || return 1
+    printf '%s' "${tools[*]}" >"$venv/.tools-installed"
   fi
   echo "$venv/bin/python"
 }

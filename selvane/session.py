@@ -1,0 +1,729 @@
+"""The debugging session: what the core reports and what the person debugging asks of it,
+without any terminal code.
+
+A `Session` initialises the core, answers its callbacks and keeps the state that a front end
+shows: the stop being answered (frame, thread, exception, return value), the frame selected
+with up/down/thread, the breakpoints with their hit and ignore counts (kept current from the
+core's changed-breakpoint lists), the exception settings and the threads. A front end
+implements `Frontend` (the console does; an editor protocol could) and calls the session's
+methods; it never calls the core itself.
+
+Threading: the core calls the callbacks in the stopped thread while holding its mutex; the
+other traced threads wait at that mutex. The front end's `stopped()` runs there, and the
+resume command it chose is given to the core (which acts on the calling thread's record)
+just before the callback returns. Nothing here takes a lock that a waiting thread may hold:
+thread names are read from the threading module's table without its lock.
+"""
+
+import builtins
+import dis
+import fnmatch
+import linecache
+import os
+import signal
+import sys
+import threading
+from dataclasses import dataclass, field
+
+import tvantrel30pydebugstackless as core
+
+from . import handlers
+from . import _ORIGINAL_IMPORT
+from .catchinfo import DEFAULT_PRINTING_HANDLERS
+
+EXCEPTION_MODES = {"never": 0, "always": 1, "unhandled": 2, "printed": 4}
+# Exceptions that end a program normally or drive iteration: never stops, unless the mode is
+# "always" or the person lists them with `catch always`.
+DEFAULT_NEVER_STOP = (SystemExit, StopIteration, StopAsyncIteration, GeneratorExit)
+_HERE = os.path.dirname(os.path.abspath(__file__))
+_IDLE_PERIOD = 0.2
+
+
+class SessionError(Exception):
+    """A request of the person debugging that cannot be done; its text says why."""
+
+
+@dataclass
+class Breakpoint:
+    number: int
+    file: str  # absolute path
+    line: int
+    temporary: bool = False
+    enabled: bool = True
+    condition: str = None
+    ignore_count: int = 0
+    hits: int = 0
+
+
+@dataclass
+class Stop:
+    """One stop of one thread. `kind` is "line", "return" or "exception"."""
+    kind: str
+    frame: object
+    thread: int  # thread identity
+    value: object = None  # the return value of a return stop
+    exc: tuple = None  # (type, value, traceback) of an exception stop
+    handler: object = None  # the frame predicted to catch the exception, or None
+    exiting: bool = False  # the exception leaves the program's outermost frame
+    reason: str = None  # "breakpoint N", "interrupted", or None (stepping, start)
+    deleted: list = field(default_factory=list)  # temporary breakpoints that fired
+    inner: object = None  # the frame where the exception was raised
+
+
+@dataclass
+class ThreadInfo:
+    number: int
+    ident: int
+    name: str
+    frame: object  # where it stands in the debugger, or None while it runs
+    stopped: bool  # the thread whose stop is being answered
+
+
+class Frontend:
+    """What a front end gives the session."""
+
+    def stopped(self, session, stop):
+        """Shows the stop and lets the person work until one resume method of the session
+        was called (or none: then the program continues)."""
+        raise NotImplementedError
+
+    def message(self, text):
+        """A line of news from the session outside any stop."""
+        raise NotImplementedError
+
+
+def _own_files():
+    """Full names of the debugger's own modules, as the core reports frame files."""
+    names = set()
+    for entry in os.listdir(_HERE):
+        if entry.endswith(".py"):
+            path = os.path.join(_HERE, entry)
+            names.add(path)
+            names.add(os.path.realpath(path))
+    return names
+
+
+class Session:
+    def __init__(self, frontend, exceptions="unhandled", autoquit=True,
+                 debug_all_threads=True, skip_threads=(), catch_info=None, on_quit=None):
+        self.frontend = frontend
+        self.on_quit = on_quit or _exit_now
+        self.own_files = _own_files()
+        self.breakpoints = {}  # number -> Breakpoint
+        self._core_ids = {}  # core id -> number
+        self._next_number = 1
+        self.stop = None  # the stop being answered
+        self.frame = None  # the selected frame
+        self.thread = None  # the identity of the thread whose frames are shown
+        self._thread_numbers = {}
+        self._resume = None
+        self._last_resume = {}  # thread identity -> last resume command
+        self._stop_requested = set()  # threads the core was told to stop (interrupt)
+        self._interrupt_pending = False
+        self._reported_exc = None  # id of the exception last shown after a continue
+        self._seeking_first_stop = True
+        self._first_stop = None
+        self._starting_thread = threading.get_ident()
+        self._program_started = False
+        self.ignored_codes = set()
+        self.skip_threads = tuple(skip_threads)
+        self.catch_info = list(DEFAULT_PRINTING_HANDLERS if catch_info is None
+                               else catch_info)
+        self.active = False
+        self._saved_sigint = None
+        self._at_prompt = False
+        self._new_imports = []
+        self._init_core(exceptions, autoquit, debug_all_threads)
+
+    # ---- the core --------------------------------------------------------------------------
+
+    def _init_core(self, exceptions, autoquit, debug_all_threads):
+        if exceptions not in EXCEPTION_MODES:
+            raise SessionError(f"unknown exception mode {exceptions!r}")
+        internal = {name: 1 for name in self.own_files}
+        core.init(_IDLE_PERIOD, EXCEPTION_MODES[exceptions], self._install_thread_hooks,
+                  self._idle, self._line_cb, self._return_cb, self._exception_cb,
+                  self._quit_cb, None, _ORIGINAL_IMPORT, None, internal)
+        core.set_autoquit(1 if autoquit else 0)
+        core.set_debug_all_threads(1 if debug_all_threads else 0)
+        if self.skip_threads:
+            core.set_debug_thread_cb(self._debug_thread)
+        core.set_never_stop_excepts(DEFAULT_NEVER_STOP)
+        core.set_exc_catch_info_list(self.catch_info)
+        # The threads' start-up code catches whatever escapes a thread's run() and prints
+        # it: for the person debugging that is an unhandled exception.
+        for function in (threading.Thread._bootstrap, threading.Thread._bootstrap_inner):
+            self.ignored_codes.add(function.__code__)
+        self._publish_ignored()
+
+    def ignore_handlers_of(self, *codes):
+        """The handlers of these code objects (the debugger's own frames that run the
+        program) do not count as catching an exception."""
+        self.ignored_codes.update(codes)
+        self._publish_ignored()
+
+    def _publish_ignored(self):
+        core.set_ignored_exception_handlers({code: 1 for code in self.ignored_codes})
+
+    def start(self, stop_at_first_line=True, first_stop=None):
+        """Starts tracing every thread; the program stops at its first line unless told
+        not to (it then runs to a breakpoint). `first_stop(frame)` tells the first stop's
+        frame: the stops before it (in the debugger's own code and in what it calls while
+        it starts) are passed through."""
+        self._seeking_first_stop = stop_at_first_line
+        self._first_stop = first_stop
+        self._starting_thread = threading.get_ident()
+        self.active = True
+        if stop_at_first_line:
+            core.step_into()
+        else:
+            core.continue_run()
+        self._install_sigint()
+        core.start_trace()
+
+    def stop_soon(self, first_stop):
+        """Stops the calling thread at the first frame for which `first_stop(frame)` is
+        true (set_trace() while the session runs)."""
+        self._seeking_first_stop = True
+        self._first_stop = first_stop
+        self._starting_thread = threading.get_ident()
+        core.step_into()
+
+    def program_started(self):
+        self._program_started = True
+
+    def finish(self):
+        """Stops tracing; the program runs on untraced (or has ended)."""
+        if not self.active:
+            return
+        self.active = False
+        core.stop_trace()
+        self._restore_sigint()
+
+    def _install_thread_hooks(self, flag):
+        # What threading.settrace() does, without running traced library code while the
+        # core starts or stops.
+        threading._trace_hook = core.bootstrap_new_thread if flag else None
+
+    def _debug_thread(self, ident):
+        thread = threading._active.get(ident)
+        name = thread.name if thread is not None else ""
+        return 0 if any(fnmatch.fnmatchcase(name, p) for p in self.skip_threads) else 1
+
+    def _quit_cb(self):
+        pass  # the program's end is reported by the runner, which knows the exit status
+
+    # ---- Ctrl-C while the program runs ---------------------------------------------------
+
+    def _install_sigint(self):
+        if threading.current_thread() is not threading.main_thread():
+            return
+        try:
+            self._saved_sigint = signal.signal(signal.SIGINT, self._sigint)
+        except ValueError:
+            self._saved_sigint = None
+
+    def _restore_sigint(self):
+        if self._saved_sigint is not None and signal.getsignal(signal.SIGINT) == self._sigint:
+            signal.signal(signal.SIGINT, self._saved_sigint)
+        self._saved_sigint = None
+
+    def _sigint(self, signum, frame):
+        if self._at_prompt:
+            raise KeyboardInterrupt
+        # core.stop() acts on the calling thread, here the main thread: it stops at its next
+        # event. Threads that run on are told by the idle callback, in their own thread.
+        self._interrupt_pending = True
+        self._stop_requested.add(threading.get_ident())
+        core.stop()
+
+    def _idle(self):
+        if self._interrupt_pending:
+            ident = threading.get_ident()
+            if ident not in self._stop_requested:
+                self._stop_requested.add(ident)
+                core.stop()
+
+    # ---- callbacks -------------------------------------------------------------------------
+
+    def _line_cb(self, frame, changed):
+        self._on_stop(Stop("line", frame, threading.get_ident()), changed)
+
+    def _return_cb(self, frame, value, changed):
+        self._on_stop(Stop("return", frame, threading.get_ident(), value=value), changed)
+
+    def _exception_cb(self, frame, exc, changed):
+        stop = Stop("exception", frame, threading.get_ident(), exc=tuple(exc))
+        self._on_stop(stop, changed)
+
+    def _on_stop(self, stop, changed):
+        hit = self._apply_changed(changed, stop)
+        ident = stop.thread
+        seeking = self._seeking_first_stop and ident == self._starting_thread
+        if seeking and self._first_stop is not None and not self._first_stop(stop.frame):
+            core.step_into()  # still in the debugger's start-up: on to the program
+            return
+        if self._is_internal(stop.frame):
+            # The debugger's own frames: step through them to the program while starting,
+            # run freely once the program is under way (it has ended, or it is a thread).
+            if seeking or ident in self._stop_requested:
+                core.step_into()  # on to the program's next line
+            else:
+                core.continue_run()
+            return
+        interrupted = ident in self._stop_requested
+        self._stop_requested.discard(ident)
+        last = self._last_resume.get(ident)
+        if stop.kind == "exception":
+            if last == "continue_run" and self._propagating(stop):
+                core.continue_run()  # the exception shown already, on its way out
+                return
+            # Ids only: holding the objects would change when the program's objects die.
+            self._reported_exc = (id(stop.exc[1]), id(stop.frame))
+            self._predict(stop)
+        elif interrupted and last == "continue_run" and hit is None:
+            if not self._interrupt_pending:
+                core.continue_run()  # an interrupt that another thread answered already
+                return
+        if interrupted and self._interrupt_pending and hit is None:
+            stop.reason = "interrupted"
+        elif hit is not None:
+            stop.reason = f"breakpoint {hit.number}"
+        self._interrupt_pending = False
+        self._seeking_first_stop = False
+        self._first_stop = None
+        self._answer(stop)
+
+    def _propagating(self, stop):
+        """Whether this exception event is the last one shown, reported again by a caller
+        as it unwinds (and not a new exception, which may reuse the old one's memory)."""
+        if self._reported_exc is None:
+            return False
+        value_id, frame_id = self._reported_exc
+        if id(stop.exc[1]) != value_id or id(stop.frame) == frame_id:
+            return False
+        tb = stop.exc[2]
+        while tb is not None:
+            if id(tb.tb_frame) == frame_id:
+                return True
+            tb = tb.tb_next
+        return False
+
+    def _answer(self, stop):
+        self.stop = stop
+        self.frame = stop.frame
+        self.thread = stop.thread
+        self._resume = None
+        try:
+            self.frontend.stopped(self, stop)
+        finally:
+            self.stop = None
+            self.frame = None
+        resume = self._resume or ("continue_run",)
+        self._last_resume[stop.thread] = resume[0]
+        if resume[0] == "quit":
+            self.finish()
+            self.on_quit()
+            return
+        getattr(core, resume[0])(*resume[1:])
+
+    def _is_internal(self, frame):
+        return frame.f_code.co_filename in self.own_files
+
+    def _apply_changed(self, changed, stop):
+        """Brings the breakpoint table up to date; answers the breakpoint of this stop's line
+        that was hit, if any."""
+        deleted, updated = changed if changed else ((), ())
+        hit = None
+        here = (os.path.abspath(stop.frame.f_code.co_filename), stop.frame.f_lineno)
+        for data in updated:
+            _file, line, core_id, enabled, temporary, cond, ignore, hits = data
+            number = self._core_ids.get(core_id)
+            bp = self.breakpoints.get(number)
+            if bp is None:
+                continue
+            grew = hits > bp.hits
+            bp.enabled, bp.ignore_count, bp.hits = bool(enabled), ignore, hits
+            if grew and (bp.file, bp.line) == here and stop.kind == "line":
+                hit = bp
+        for core_id in deleted:
+            number = self._core_ids.pop(core_id, None)
+            bp = self.breakpoints.pop(number, None)
+            if bp is not None:
+                bp.hits += 1
+                stop.deleted.append(bp)
+                if (bp.file, bp.line) == here:
+                    hit = bp
+        return hit
+
+    def _predict(self, stop):
+        exc_type, _value, tb = stop.exc
+        inner = stop.frame
+        while tb is not None:
+            inner = tb.tb_frame
+            tb = tb.tb_next
+        stop.handler = handlers.find_handler(stop.frame, exc_type, self.ignored_codes)
+        if stop.handler is not None and self._is_internal(stop.handler):
+            stop.handler = None
+        stop.exiting = bool(core.exiting_on_exception())
+        stop.inner = inner
+
+    # ---- resume commands (a front end calls one, then returns from stopped()) -------------
+
+    def _set_resume(self, *command):
+        if self.stop is None:
+            raise SessionError("the program is not stopped")
+        self._resume = command
+
+    def step(self):
+        self._set_resume("step_into")
+
+    def next(self):
+        self._set_resume("step_over")
+
+    def step_out(self):
+        self._set_resume("step_out")
+
+    def cont(self):
+        self._set_resume("continue_run")
+
+    def until(self, line=None):
+        """Runs until a line below `line` (default: the current line) is passed in the
+        current frame, or the frame returns."""
+        current = self.stop.frame.f_lineno
+        last = current if line is None else line - 1
+        if line is not None and line <= current:
+            raise SessionError(f"line {line} is not after the current line {current}")
+        self._set_resume("step_over_line_range", 0, last)
+
+    def quit(self):
+        self._set_resume("quit")
+
+    def jump(self, line):
+        """Makes `line` the next line to run in the stopped frame."""
+        stop = self.stop
+        if stop is None:
+            raise SessionError("the program is not stopped")
+        if self.frame is not stop.frame:
+            raise SessionError("can only jump in the frame where the program stopped "
+                               "(go back there with `down`)")
+        if stop.kind != "line":
+            raise SessionError("can only jump at a line stop, not at a "
+                               f"{stop.kind} stop")
+        try:
+            stop.frame.f_lineno = line
+        except ValueError as error:
+            raise SessionError(f"cannot jump to line {line}: {error}") from None
+
+    # ---- frames and threads ----------------------------------------------------------------
+
+    def stack(self, frame=None):
+        """The program's frames from the outermost to `frame` (default: the thread's
+        innermost), without the debugger's own."""
+        frame = frame if frame is not None else self._innermost()
+        frames = []
+        while frame is not None:
+            if not self._is_internal(frame):
+                frames.append(frame)
+            elif frames:
+                break  # the debugger's runner: what lies beyond it is not the program's
+            frame = frame.f_back
+        frames.reverse()
+        return frames
+
+    def _innermost(self):
+        if self.stop is not None and self.thread == self.stop.thread:
+            return self.stop.frame
+        return self._thread_frame(self.thread)
+
+    def _thread_frame(self, ident):
+        for tid in core.get_threads():
+            if core.get_thread_ident_for_tstate_id(tid) == ident:
+                return core.get_curr_frame(tid)
+        return None
+
+    def move(self, count):
+        """Selects the frame `count` levels out (positive) or in (negative)."""
+        frames = self.stack()
+        if not frames:
+            raise SessionError("no frame to show")
+        index = frames.index(self.frame) if self.frame in frames else len(frames) - 1
+        target = index - count
+        if target < 0:
+            raise SessionError("oldest frame")
+        if target >= len(frames):
+            raise SessionError("newest frame")
+        self.frame = frames[target]
+        return self.frame
+
+    def threads(self):
+        """The live threads the core knows, numbered in the order first seen."""
+        result = []
+        active = dict(threading._active)  # no lock: a waiting thread may hold it
+        seen = set()
+        for tid in core.get_threads():
+            ident = core.get_thread_ident_for_tstate_id(tid)
+            if ident is None or ident in seen or ident not in active:
+                continue
+            seen.add(ident)
+            number = self._thread_numbers.setdefault(ident, len(self._thread_numbers) + 1)
+            stopped = self.stop is not None and ident == self.stop.thread
+            frame = self.stop.frame if stopped else core.get_curr_frame(tid)
+            if frame is not None and self._is_internal(frame):
+                frame = None
+            result.append(ThreadInfo(number, ident, active[ident].name, frame, stopped))
+        result.sort(key=lambda t: t.number)
+        return result
+
+    def thread_name(self, ident):
+        thread = threading._active.get(ident)
+        return thread.name if thread is not None else f"thread {ident}"
+
+    def select_thread(self, number):
+        for info in self.threads():
+            if info.number == number:
+                if info.frame is None:
+                    raise SessionError(f"thread {number} ({info.name}) is running outside "
+                                       "the program's traced code")
+                self.thread = info.ident
+                self.frame = info.frame
+                return info
+        raise SessionError(f"no thread {number}; `threads` lists them")
+
+    # ---- breakpoints -----------------------------------------------------------------------
+
+    def resolve_file(self, name):
+        """An absolute path for a file name given by the person: relative to the working
+        directory, else found on sys.path, else the file of the selected frame's module."""
+        candidates = [os.path.abspath(name)]
+        if not os.path.isabs(name):
+            candidates += [os.path.join(p or os.getcwd(), name) for p in sys.path]
+        for path in candidates:
+            if os.path.isfile(path):
+                return os.path.abspath(path)
+        raise SessionError(f"no file {name!r}")
+
+    def parse_location(self, location):
+        """`[FILE:]LINE` or a function name -> (file, line)."""
+        location = location.strip()
+        if not location:
+            raise SessionError("a location is needed: [FILE:]LINE or FUNCTION")
+        file, _, line = location.rpartition(":")
+        if line.strip().isdigit():
+            if file:
+                path = self.resolve_file(file.strip())
+            elif self.frame is not None:
+                path = os.path.abspath(self.frame.f_code.co_filename)
+            elif self.main_file:
+                path = self.main_file
+            else:
+                raise SessionError("no current file: give FILE:LINE")
+            return path, int(line)
+        if ":" in location:
+            raise SessionError(f"bad location {location!r}: expected [FILE:]LINE or FUNCTION")
+        return self._function_location(location)
+
+    main_file = None
+
+    def _function_location(self, name):
+        if self.frame is None:
+            raise SessionError(f"cannot find function {name!r} before the program runs; "
+                               "give FILE:LINE")
+        if not all(part.isidentifier() for part in name.split(".")):
+            raise SessionError(f"bad location {name!r}: expected [FILE:]LINE or FUNCTION")
+        try:
+            function = self.evaluate(name)
+        except Exception as error:
+            raise SessionError(f"no function {name!r}: {_one_line(error)}") from None
+        code = getattr(getattr(function, "__func__", function), "__code__", None)
+        if code is None:
+            raise SessionError(f"{name!r} is not a Python function")
+        lines = sorted(line for _, line in dis.findlinestarts(code)
+                       if line is not None and line > code.co_firstlineno)
+        return os.path.abspath(code.co_filename), (lines[0] if lines else code.co_firstlineno)
+
+    def add_breakpoint(self, location, condition=None, temporary=False):
+        path, line = self.parse_location(location)
+        source = linecache.getline(path, line)
+        if not source:
+            raise SessionError(f"{_show_path(path)} has no line {line}")
+        stripped = source.strip()
+        if not stripped or stripped.startswith("#"):
+            raise SessionError(f"line {line} of {_show_path(path)} is blank or a comment")
+        if condition is not None:
+            try:
+                compile(condition, "<condition>", "eval")
+            except SyntaxError as error:
+                raise SessionError(f"bad condition {condition!r}: {error.msg}") from None
+        for bp in self.breakpoints.values():
+            if (bp.file, bp.line) == (path, line):
+                raise SessionError(f"breakpoint {bp.number} is already at "
+                                   f"{_show_path(path)}:{line}")
+        core_id = core.set_break(path, line, 1, 1 if temporary else 0, condition, 0)
+        bp = Breakpoint(self._next_number, path, line, temporary, True, condition)
+        self._next_number += 1
+        self.breakpoints[bp.number] = bp
+        self._core_ids[core_id] = bp.number
+        return bp
+
+    def breakpoint(self, number):
+        try:
+            return self.breakpoints[int(number)]
+        except (ValueError, KeyError):
+            raise SessionError(f"no breakpoint {number}") from None
+
+    def clear_breakpoint(self, number):
+        bp = self.breakpoint(number)
+        core.clear_breaks(bp.file, bp.line)
+        del self.breakpoints[bp.number]
+        for core_id, known in list(self._core_ids.items()):
+            if known == bp.number:
+                del self._core_ids[core_id]
+        return bp
+
+    def enable_breakpoint(self, number, enabled=True):
+        bp = self.breakpoint(number)
+        core.enable_breaks(bp.file, bp.line, 1 if enabled else 0)
+        bp.enabled = enabled
+        return bp
+
+    def set_condition(self, number, condition):
+        bp = self.breakpoint(number)
+        if condition:
+            try:
+                compile(condition, "<condition>", "eval")
+            except SyntaxError as error:
+                raise SessionError(f"bad condition {condition!r}: {error.msg}") from None
+        core.set_breaks_cond(bp.file, bp.line, condition or None)
+        bp.condition = condition or None
+        return bp
+
+    def set_ignore(self, number, count):
+        bp = self.breakpoint(number)
+        if count < 0:
+            raise SessionError("an ignore count cannot be negative")
+        core.ignore_breaks(bp.file, bp.line, count)
+        bp.ignore_count = count
+        return bp
+
+    def breakpoint_lines(self, path):
+        return {bp.line for bp in self.breakpoints.values() if bp.file == path}
+
+    # ---- exceptions ------------------------------------------------------------------------
+
+    def exception_mode(self):
+        mode = core.get_exception_mode()
+        return next((name for name, value in EXCEPTION_MODES.items() if value == mode),
+                    str(mode))
+
+    def set_exception_mode(self, name):
+        if name not in EXCEPTION_MODES:
+            raise SessionError(f"unknown exception mode {name!r}: one of "
+                               + ", ".join(EXCEPTION_MODES))
+        core.set_exception_mode(EXCEPTION_MODES[name])
+
+    def _exception_types(self, names):
+        types = []
+        for name in names:
+            try:
+                value = self.evaluate(name) if self.frame is not None else \
+                    getattr(builtins, name)
+            except Exception:
+                raise SessionError(f"no exception type {name!r}") from None
+            if not (isinstance(value, type) and issubclass(value, BaseException)):
+                raise SessionError(f"{name!r} is not an exception type")
+            types.append(value)
+        return tuple(types)
+
+    def prints_exceptions(self, frame):
+        """Whether the frame runs a function of the catch-info list that prints what it
+        catches (where the "printed" mode stops)."""
+        if core.get_exception_mode() not in (4, 5):
+            return False
+        code = frame.f_code
+        module = frame.f_globals.get("__name__")
+        for info in self.catch_info:
+            if info.co_name == code.co_name and info.mod_name in ("*", module) \
+                    and info.prints and not info.parent:
+                return True
+        return False
+
+    def set_always_stop(self, names):
+        core.set_always_stop_excepts(self._exception_types(names))
+
+    def set_never_stop(self, names):
+        core.set_never_stop_excepts(self._exception_types(names))
+
+    def always_stop(self):
+        return core.get_always_stop_excepts()
+
+    def never_stop(self):
+        return core.get_never_stop_excepts()
+
+    def ignore_here(self):
+        """Exceptions at the place where the current exception was raised stop no more."""
+        stop = self.stop
+        if stop is None or stop.kind != "exception":
+            raise SessionError("not stopped at an exception")
+        inner = stop.inner
+        path = core.get_frame_file(inner)
+        core.ignore_exception_loc(path, inner.f_lineno, 1)
+        return path, inner.f_lineno
+
+    # ---- evaluation ------------------------------------------------------------------------
+
+    def namespaces(self, frame=None):
+        frame = frame if frame is not None else self.frame
+        if frame is None:
+            raise SessionError("no frame to evaluate in")
+        return frame.f_globals, frame.f_locals
+
+    def evaluate(self, expression, frame=None):
+        """The value of an expression in the selected frame; its exceptions propagate."""
+        globals_, locals_ = self.namespaces(frame)
+        code = compile(expression, "<selvane>", "eval")
+        return eval(code, globals_, locals_)
+
+    def execute(self, statement, frame=None):
+        """Runs a statement in the selected frame; assignments to local variables reach the
+        running function."""
+        frame = frame if frame is not None else self.frame
+        globals_, locals_ = self.namespaces(frame)
+        code = compile(statement + "\n", "<selvane>", "single")
+        try:
+            exec(code, globals_, locals_)
+        finally:
+            if sys.version_info < (3, 13) and locals_ is not globals_:
+                # 3.11 and 3.12 hand out a copy of the fast locals; write it back.
+                core.locals_to_fast(frame)
+
+    def names(self, frame=None):
+        globals_, locals_ = self.namespaces(frame)
+        return set(locals_) | set(globals_) | set(dir(builtins))
+
+    def take_new_imports(self):
+        return list(core.get_new_imports())
+
+
+def _one_line(error):
+    text = str(error)
+    return f"{type(error).__name__}: {text}" if text else type(error).__name__
+
+
+def _show_path(path):
+    try:
+        relative = os.path.relpath(path)
+    except ValueError:
+        return path
+    return relative if not relative.startswith("..") else path
+
+
+def _exit_now():
+    """Ends the process at once: the person quit, no more of the program runs. What the
+    program has written so far still reaches its files."""
+    for stream in (sys.stdout, sys.stderr, sys.__stdout__, sys.__stderr__):
+        try:
+            stream.flush()
+        except Exception:
+            pass
+    os._exit(1)
