@@ -11,6 +11,7 @@ import sys
 import pytest
 
 from conftest import assert_stops, ok, run_plain, run_traced
+from test_exceptions import INFO_CLASS, PRINTING
 
 FREE = dict(first="continue_run", default="continue_run", when_elsewhere="continue_run")
 
@@ -265,39 +266,7 @@ def test_ignored_handlers_by_frame_object_apply_to_that_frame_only(tmp_path):
 
 # ---- the catch-info list through its method --------------------------------------------------
 
-PRINTING = """
-    import traceback
-
-    def report(f):
-        try:
-            f()
-        except Exception:
-            traceback.print_exc(limit=0)
-
-    def boom():
-        raise KeyError("printed")
-
-    class Runner:
-        def run_child(self, f):
-            f()
-
-    def parent_reports(f):
-        try:
-            Runner().run_child(f)
-        except Exception:
-            print("caught by the parent")
-
-    report(boom)
-    parent_reports(boom)
-"""
-
-INFO = """
-class Info:
-    def __init__(self, co_name, mod_name, containing_class, prints, parent):
-        self.co_name, self.mod_name = co_name, mod_name
-        self.containing_class = containing_class
-        self.prints, self.parent = prints, parent
-
+INFO = INFO_CLASS + """
 REPORT = Info("report", "__main__", "*", True, False)
 RUN_CHILD = Info("run_child", "*", "Runner", True, True)
 """

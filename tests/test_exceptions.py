@@ -263,13 +263,16 @@ PRINTING = """
     parent_reports(boom)
 """
 
-CATCH_INFO = """
+# A catch-info class of the server side's kind: the attributes the core reads.
+INFO_CLASS = """
 class Info:
     def __init__(self, co_name, mod_name, containing_class, prints, parent):
         self.co_name, self.mod_name = co_name, mod_name
         self.containing_class = containing_class
         self.prints, self.parent = prints, parent
+"""
 
+CATCH_INFO = INFO_CLASS + """
 core.set_exc_catch_info_list([
     Info("report", "__main__", "*", True, False),
     Info("run_child", "*", "Runner", True, True),
