@@ -15,10 +15,24 @@ Modes:
   null-c-locked   the same, taking and releasing one thread lock per event
   core-free       the core installed and running freely (continue_run, no breakpoint): the
                   common case of a program under the debugger
+  core-bp-elsewhere  the core running freely with one breakpoint in another file (this
+                  one), on a line number that no line of the workload has: each line event
+                  costs the lookup of its line number in a breakpoint table that is not empty
+  core-bp-unreached  the core running freely with one breakpoint in the workload's own file,
+                  on a line the workload never reaches (as the bdb mode has it)
   core-step-over  the core stepping over a call: stopped in a driver frame, the command is
                   step_over, and the driver then calls the workload, so every event of the
                   workload is one where the core must find that the stop frame is an outer
                   frame and answer "no stop"
+  exc-untraced    the exception workload (workload.exc_workload: raising and catching in the
+                  same frame and one frame out), no trace function
+  exc-null-c      the exception workload under the null C tracer: its floor
+  exc-core-never  the exception workload under the core running freely in exception mode 0
+                  (never stop): exception events are recorded per frame, nothing analysed
+  exc-core-unhandled
+                  the same in exception mode 2 (stop on unhandled exceptions only): every
+                  exception is analysed (handlers predicted from the byte code) and, all
+                  being caught, none stops. The aim is within 2x of exc-core-never
   bdb             bdb.Bdb running freely with a breakpoint on a line the workload never
                   reaches, in the workload's own file (see _FreeRunningBdb)
   bdb-elsewhere   the same with the breakpoint in another file: bdb then traces no line of
@@ -29,7 +43,8 @@ Modes:
                   runs in a process of its own (see debugpy_child.py)
 
 The number of events is counted once with a sys.settrace counter over one workload call, and
-checked against what the counting variant of the null C tracer sees.
+checked against what the counting variant of the null C tracer sees. The exc-* modes run the
+exception workload: their events are counted on it, and their floor is exc-null-c.
 
 With --json the results also go to results-<python version>.json beside this script.
 """
@@ -51,6 +66,9 @@ sys.path.insert(0, HERE)
 import workload as wl  # noqa: E402
 
 perf_counter = time.perf_counter
+# The interpreter's own import function: init replaces the builtins' __import__ with the
+# core's hook, and a later init must be given the original, not the hook.
+_ORIGINAL_IMPORT = __import__
 VERSION = platform.python_version()
 
 
@@ -65,11 +83,12 @@ class Failed(Exception):
 # ---- timing ---------------------------------------------------------------------------------
 
 
-def timed(n):
+def timed(n, work=None):
+    work = work or wl.workload
     # One line, so that a tracer sees one line event here, before t0 is taken, and none
     # between the workload's return and t1: a debugger that stops on this frame's lines
     # (core-step-over) stops outside the measured span.
-    t0 = perf_counter(); wl.workload(n); t1 = perf_counter()  # noqa: E702
+    t0 = perf_counter(); work(n); t1 = perf_counter()  # noqa: E702
     return t1 - t0
 
 
@@ -151,8 +170,8 @@ class _CallbackCounter:
 
 
 def _init_core(core, line_cb, return_cb, exception_cb):
-    core.init(0.0, 0, _noop, _noop, line_cb, return_cb, exception_cb, _noop, None, __import__,
-              None, {})
+    core.init(0.0, 0, _noop, _noop, line_cb, return_cb, exception_cb, _noop, None,
+              _ORIGINAL_IMPORT, None, {})
 
 
 def _check_core_installed():
@@ -160,10 +179,50 @@ def _check_core_installed():
         raise Failed("start_trace() left the thread without a trace function")
 
 
-def mode_core_free(n):
+def mode_core_free(n, work=None, exception_mode=0):
     core = _core()
     counter = _CallbackCounter()
     _init_core(core, counter.line, counter.ret, counter.exc)
+    core.set_exception_mode(exception_mode)
+    core.continue_run()
+    core.start_trace()
+    try:
+        _check_core_installed()
+        elapsed = timed(n, work)
+    finally:
+        core.stop_trace()
+        core.reset()
+    if any(counter.calls.values()):
+        raise Failed(f"the core stopped while running freely: callbacks {counter.calls}")
+    return elapsed
+
+
+def mode_exc_untraced(n):
+    return timed(n, wl.exc_workload)
+
+
+def mode_exc_null(n):
+    tracer = _null_tracer()
+    tracer.install()
+    try:
+        return timed(n, wl.exc_workload)
+    finally:
+        tracer.uninstall()
+
+
+def mode_exc_core_never(n):
+    return mode_core_free(n, wl.exc_workload, exception_mode=0)
+
+
+def mode_exc_core_unhandled(n):
+    return mode_core_free(n, wl.exc_workload, exception_mode=2)
+
+
+def _run_core_with_breakpoint(n, filename, line):
+    core = _core()
+    counter = _CallbackCounter()
+    _init_core(core, counter.line, counter.ret, counter.exc)
+    core.set_break(filename, line, 1, 0, None, 0)
     core.continue_run()
     core.start_trace()
     try:
@@ -173,8 +232,26 @@ def mode_core_free(n):
         core.stop_trace()
         core.reset()
     if any(counter.calls.values()):
-        raise Failed(f"the core stopped while running freely: callbacks {counter.calls}")
+        raise Failed(f"the core stopped at an unreached breakpoint: callbacks {counter.calls}")
     return elapsed
+
+
+def _workload_lines():
+    lines = set()
+    for function in (wl.leaf, wl.workload):
+        lines.update(line for _, _, line in function.__code__.co_lines() if line is not None)
+    return lines
+
+
+def mode_core_bp_elsewhere(n):
+    line = never_reached_line(_never_called_here)
+    if line in _workload_lines():
+        raise Failed(f"line {line} of this file is also a line of the workload")
+    return _run_core_with_breakpoint(n, __file__, line)
+
+
+def mode_core_bp_unreached(n):
+    return _run_core_with_breakpoint(n, wl.__file__, never_reached_line(wl.never_called))
 
 
 def _stepped_driver(n):
@@ -309,18 +386,27 @@ MODES = {
     "null-c": mode_null,
     "null-c-locked": mode_null_locked,
     "core-free": mode_core_free,
+    "core-bp-elsewhere": mode_core_bp_elsewhere,
+    "core-bp-unreached": mode_core_bp_unreached,
     "core-step-over": mode_core_step_over,
+    "exc-untraced": mode_exc_untraced,
+    "exc-null-c": mode_exc_null,
+    "exc-core-never": mode_exc_core_never,
+    "exc-core-unhandled": mode_exc_core_unhandled,
     "bdb": mode_bdb,
     "bdb-elsewhere": mode_bdb_elsewhere,
     # debugpy runs in a process of its own: see measure_debugpy().
 }
 FLOOR = "null-c"
+# The modes that run the exception workload, and their floor.
+EXC_MODES = ("exc-untraced", "exc-null-c", "exc-core-never", "exc-core-unhandled")
+EXC_FLOOR = "exc-null-c"
 
 
 # ---- event count ----------------------------------------------------------------------------
 
 
-def count_events(n):
+def count_events(n, work=None):
     """The events of one workload(n) call, by kind, as sys.settrace sees them."""
     counts = {}
 
@@ -330,7 +416,7 @@ def count_events(n):
 
     sys.settrace(trace)
     try:
-        wl.workload(n)
+        (work or wl.workload)(n)
     finally:
         sys.settrace(None)
     return counts
@@ -416,16 +502,18 @@ def measure(modes, iterations, repeats):
     return {mode: times[mode] for mode in active}, skipped
 
 
-def summarise(times, events):
-    floor = min(times[FLOOR]) if FLOOR in times else None
+def summarise(times, events, exc_events=None):
     rows = {}
     for mode, values in times.items():
+        floor_mode = EXC_FLOOR if mode in EXC_MODES else FLOOR
+        floor = min(times[floor_mode]) if floor_mode in times else None
+        n_events = exc_events if mode in EXC_MODES else events
         best = min(values)
         rows[mode] = {
             "best_s": best,
             "median_s": statistics.median(values),
-            "ns_per_event": best / events * 1e9,
-            "ns_per_event_above_floor": (best - floor) / events * 1e9 if floor else None,
+            "ns_per_event": best / n_events * 1e9,
+            "ns_per_event_above_floor": (best - floor) / n_events * 1e9 if floor else None,
             "ratio_to_floor": best / floor if floor else None,
             "times_s": values,
         }
@@ -440,19 +528,19 @@ def print_table(rows, skipped, events, counts, c_counts, iterations, repeats):
         seen = sum(c_counts.values())
         print(f"  the counting C tracer saw {seen} events over the timed span "
               f"({seen - events:+d}: the timing line's own events)")
-    header = (f"{'mode':<16}{'best s':>10}{'median s':>10}{'ns/event':>10}"
+    header = (f"{'mode':<20}{'best s':>10}{'median s':>10}{'ns/event':>10}"
               f"{'+ns over null':>15}{'x null':>8}")
     print(header)
     print("-" * len(header))
     for mode, row in rows.items():
         above = row["ns_per_event_above_floor"]
         ratio = row["ratio_to_floor"]
-        print(f"{mode:<16}{row['best_s']:>10.4f}{row['median_s']:>10.4f}"
+        print(f"{mode:<20}{row['best_s']:>10.4f}{row['median_s']:>10.4f}"
               f"{row['ns_per_event']:>10.1f}"
               f"{(f'{above:+.1f}' if above is not None else '-'):>15}"
               f"{(f'{ratio:.2f}' if ratio is not None else '-'):>8}")
     for mode, reason in skipped.items():
-        print(f"{mode:<16}skipped: {reason}")
+        print(f"{mode:<20}skipped: {reason}")
 
 
 def main(argv=None):
@@ -502,8 +590,19 @@ def main(argv=None):
                 args.debugpy_python, args.iterations, args.repeats)
         except Skip as exc:
             skipped["debugpy"] = str(exc)
-    rows = summarise(times, events)
+    exc_counts = (count_events(args.iterations, wl.exc_workload)
+                  if any(m in EXC_MODES for m in wanted) else {})
+    exc_events = sum(exc_counts.values())
+    rows = summarise(times, events, exc_events)
     print_table(rows, skipped, events, counts, c_counts, args.iterations, args.repeats)
+    if exc_counts:
+        kinds = ", ".join(f"{kind} {count}" for kind, count in sorted(exc_counts.items()))
+        print(f"exc-* modes: the exception workload, {exc_events} events per run ({kinds}); "
+              f"their floor is {EXC_FLOOR}")
+    if "exc-core-never" in rows and "exc-core-unhandled" in rows:
+        ratio = rows["exc-core-unhandled"]["best_s"] / rows["exc-core-never"]["best_s"]
+        rows["exc-core-unhandled"]["ratio_to_exc_core_never"] = ratio
+        print(f"exc-core-unhandled / exc-core-never: {ratio:.2f} (aim: at most 2)")
     for mode, note in notes.items():
         print(f"{mode}: {note}")
 
@@ -519,6 +618,8 @@ def main(argv=None):
                 "repeats": args.repeats,
                 "events_per_run": events,
                 "events_by_kind": counts,
+                "exc_events_per_run": exc_events,
+                "exc_events_by_kind": exc_counts,
                 "floor": FLOOR,
                 "modes": rows,
                 "skipped": skipped,

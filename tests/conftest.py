@@ -32,6 +32,7 @@ class Run:
     tracing_after_stop: int = -1
     after_stop: object = None
     stop_count: int = 0
+    break_ids: list = field(default_factory=list)
 
 
 def write_program(tmp_path, source, name="prog.py"):
@@ -65,6 +66,7 @@ def run_traced(tmp_path, program, timeout=TIMEOUT, **config):
         run.tracing_after_stop = data["tracing_after_stop"]
         run.after_stop = data.get("after_stop")
         run.stop_count = data.get("stop_count", 0)
+        run.break_ids = data.get("break_ids", [])
     elif proc.returncode < 0 or "Fatal Python error" in proc.stderr:
         pytest.fail(f"traced run crashed ({proc.returncode}):\n{proc.stderr}")
     return run

@@ -43,6 +43,16 @@ Configuration keys:
   stop_in_atexit   stop tracing (and write the results) only at exit, after the server's
                    own bottom frame has returned
   debug_file       path of the core's debug output file
+  breaks           list of set_break argument lists [file, line, enabled, temporary, cond,
+                   ignore_count], set after the prelude, before tracing starts; the ids are
+                   written as "break_ids"
+  record_changed   append to each recorded stop the changed-breakpoint lists that the callback
+                   received, as [[deleted ids], [[file, line, id, enabled, temporary, cond,
+                   ignore_count, hit_count], ...]]
+  import_cb        give the core an import callback that appends ["import", module name,
+                   thread name] to the events
+  import_cb_exec   Python source that callback runs after recording (names: core, shared,
+                   server, module, threading)
   wait_in          {"thread name": seconds}: that thread's first recorded stop waits up to
                    that long for shared.go (a threading.Event the program sets) and records
                    whether it came; then probe_after (an expression like probe) is recorded
@@ -93,6 +103,7 @@ class Server:
         self.max_stops = config.get("max_stops", 100000)
         self.fail_in = config.get("fail_in")
         self.stops = []
+        self.break_ids = []
         self.stop_count = 0
         self.events = []  # quit, idle and thread-hook calls, in order
         self.thread_names = {_MAIN_IDENT: "main"}
@@ -101,6 +112,7 @@ class Server:
         self.thread_policy = policy
         self.frame = None  # the frame of the stop being answered
         self.debug_file = None
+        self.changed = _NOTHING  # the changed-breakpoint lists of the stop being answered
 
     # ---- helpers ------------------------------------------------------------------------
 
@@ -154,19 +166,22 @@ class Server:
 
     def init_core(self):
         """Initialises the core with this server's callbacks (also from inside a callback)."""
+        import_cb = self.import_cb if self.config.get("import_cb") else None
         core.init(float(self.config.get("idle_period", 0.0)),
                   int(self.config.get("exception_mode", 0)), self.install_thread_hooks_cb,
                   self.idle_cb, self.line_cb, self.return_cb, self.exception_cb, self.quit_cb,
-                  None, _DEFAULT_IMPORT, self.debug_file, {_SELF: 1})
+                  import_cb, _DEFAULT_IMPORT, self.debug_file, {_SELF: 1})
 
-    def stop(self, kind, frame, extra=_NOTHING):
+    def stop(self, kind, frame, extra=_NOTHING, changed=_NOTHING):
         # "exec" commands see the frame of this stop only: holding it longer would change
         # when the program's objects die, and so which code runs traced.
         self.frame = frame
+        self.changed = changed
         try:
             self.answer(kind, frame, extra)
         finally:
             self.frame = None
+            self.changed = _NOTHING
 
     def answer(self, kind, frame, extra):
         if self.fail_in == kind:
@@ -189,6 +204,8 @@ class Server:
         if self.config.get("record_curr_frame"):
             tid = core.get_current_tstate_id()
             record.append(core.get_curr_frame(tid) is frame)
+        if self.config.get("record_changed"):
+            record.append(_jsonable(self.changed))
         if "probe" in self.config:
             names = {"core": core, "frame": frame, "shared": shared, "server": self,
                      "threading": threading, "outermost": outermost, "sys": sys}
@@ -206,13 +223,20 @@ class Server:
     # ---- callbacks ----------------------------------------------------------------------
 
     def line_cb(self, frame, changed):
-        self.stop("line", frame)
+        self.stop("line", frame, changed=changed)
 
     def return_cb(self, frame, value, changed):
-        self.stop("return", frame, _summary(value))
+        self.stop("return", frame, _summary(value), changed)
 
     def exception_cb(self, frame, exc_arg, changed):
-        self.stop("exception", frame, exc_arg[0].__name__)
+        self.stop("exception", frame, exc_arg[0].__name__, changed)
+
+    def import_cb(self, module):
+        self.events.append(["import", getattr(module, "__name__", repr(module)),
+                            self.thread_label()])
+        if "import_cb_exec" in self.config:
+            exec(self.config["import_cb_exec"], {"core": core, "shared": shared, "server": self,
+                                                 "module": module, "threading": threading})
 
     def quit_cb(self):
         self.events.append(["quit", self.thread_label()])
@@ -249,6 +273,16 @@ def _summary(value):
     return type(value).__name__
 
 
+def _jsonable(value):
+    if value is _NOTHING:
+        return "(none)"
+    if isinstance(value, (list, tuple)):
+        return [_jsonable(v) for v in value]
+    if value is None or isinstance(value, (int, float, str, bool)):
+        return value
+    return repr(value)
+
+
 def _patch_thread_start(server):
     """Names threads in our own table and tells the core when a thread ends."""
     original = threading.Thread._bootstrap_inner
@@ -281,6 +315,7 @@ def main(config_path):
         core.set_debug_thread_cb(server.debug_thread_cb)
     if "prelude" in config:
         exec(config["prelude"], {"core": core, "shared": shared, "threading": threading})
+    server.break_ids = [core.set_break(*args) for args in config.get("breaks", [])]
     sys.argv = [server.program]
     # As `python program.py` does: the program's folder comes first on the import path.
     sys.path.insert(0, os.path.dirname(server.program))
@@ -300,7 +335,8 @@ def main(config_path):
 def finish(server, config):
     core.stop_trace()
     result = {"stops": server.stops, "stop_count": server.stop_count, "events": server.events,
-              "threads_after": len(core.get_threads()), "tracing_after_stop": core.get_tracing()}
+              "threads_after": len(core.get_threads()), "tracing_after_stop": core.get_tracing(),
+              "break_ids": server.break_ids}
     if "after_stop" in config:
         names = {"core": core, "shared": shared, "sys": sys, "threading": threading}
         result["after_stop"] = eval(config["after_stop"], names)

@@ -215,6 +215,20 @@ def test_concurrent_lifecycle_rounds_leave_the_total_flat():
 
 
 @needs_debug
+def test_breakpoint_and_import_rounds_leave_the_total_flat():
+    # Each round sets 3000 breakpoints, hits them (conditions true, false and broken,
+    # temporary ones, ignore counts) in two threads, imports, imports again, reloads and
+    # registers modules with an import callback, fetches the new-imports and changed lists,
+    # changes and clears the breakpoints, stops tracing and resets. After the first round
+    # every round must leave the total where it was.
+    out = subprocess.run([sys.executable, os.path.join(HERE, "refcount_breakpoints.py"), "6"],
+                         capture_output=True, text=True, timeout=300, check=True).stdout
+    totals = [int(x) for x in out.split()]
+    assert len(totals) == 6
+    assert totals[1:] == [totals[0]] * 5, totals
+
+
+@needs_debug
 def test_exception_rounds_in_every_mode_leave_the_total_flat():
     # Raises caught in the same frame, further out, by loops and generators, frames left by
     # exceptions (their records), a RecursionError, in modes 0, 1, 2, 4 and 5 with every

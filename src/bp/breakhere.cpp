@@ -81,6 +81,22 @@ bool files_match(BpOpsData* data, const LineEvent& at, const Breakpoint* bp) {
   return modfile != nullptr && strcmp(modfile, bp->module_filename) == 0;
 }
 
+// The locals a condition is evaluated with: the current values of the frame's variables,
+// never written back. On 3.11 and 3.12 PyFrame_GetLocals copies the fast locals into the
+// frame's locals dictionary; from 3.13 on it answers a write-through proxy of them, so a
+// condition such as `(x := 5) == 0` would change the program's variable. A function frame's
+// condition therefore gets a dictionary copy on every version. Module-level code and class
+// bodies have no fast locals: their namespace is used as it is.
+Ref condition_locals(PyFrameObject* f) {
+  Ref locals = Ref::steal(PyFrame_GetLocals(f));
+  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(f)));
+  bool fast = (reinterpret_cast<PyCodeObject*>(code.get())->co_flags & CO_OPTIMIZED) != 0;
+  if (!locals || !fast) return locals;
+  Ref copy = Ref::steal(PyDict_New());
+  if (!copy || PyDict_Update(copy.get(), locals.get()) != 0) return Ref();
+  return copy;
+}
+
 // Evaluates a condition in the frame's namespace: 1 true, 0 false, -1 when it cannot be
 // evaluated (a broken condition stops). Nothing it raises reaches the program.
 int evaluate_condition(const LineEvent& at, const char* cond) {
@@ -95,11 +111,7 @@ int evaluate_condition(const LineEvent& at, const char* cond) {
     }
   } else {
     auto* f = reinterpret_cast<PyFrameObject*>(at.frame);
-    // The condition must see the current values of local variables. On 3.11 and 3.12
-    // PyFrame_GetLocals copies the fast locals into the frame's locals dictionary first; from
-    // 3.13 on it answers a write-through proxy of the fast locals. Either is a mapping that
-    // serves as the locals of the evaluation; nothing is copied back.
-    Ref locals = Ref::steal(PyFrame_GetLocals(f));
+    Ref locals = condition_locals(f);
     Ref globals = Ref::steal(PyFrame_GetGlobals(f));
     if (locals && globals) {
       result =
@@ -132,9 +144,12 @@ bool take_hit(BpOpsData* data, Breakpoint* bp, int count) {
 
 int __tracer_break_here(BpOpsData* data, int event, ThreadData* thread, PyObject* frame,
                         int count) {
-  if (!compat::is_plain_frame(frame)) return 0;
-  LineEvent at{thread, frame, event};
-  if (__tracer_sub_language_get_frame_category(thread, frame) == 1) {
+  // No breakpoint anywhere: nothing to find, whatever the frame (the common line event).
+  if (data->bp_table.num_entries == 0 || !compat::is_plain_frame(frame)) return 0;
+  LineEvent at{thread, frame, event, nullptr, 0, false, Ref()};
+  // Only a thread inside a sub-language has key frames (an inline test before the call).
+  if (thread != nullptr && thread->sub_language_hook &&
+      __tracer_sub_language_get_frame_category(thread, frame) == 1) {
     enter_debugger();  // the hook is Python code
     if (!translate_sub_language_frame(at)) return 0;
   } else {

@@ -394,8 +394,11 @@ int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
       return forget_exception_of(frame, -1);
     if (untraced_after_stop(frame)) return 0;
   }
-  bool sub_language = __tracer_sub_language_get_frame_category(data, frame) != -1;
-  bool stop = (!sub_language && data->step_out_frame.is(frame)) || stop_here_for(data, frame, 2);
+  // A step-out stops at the frame it leaves, unless that is a sub-language frame, where only
+  // the stepping state decides (the frame category is asked only when the frame matches).
+  bool stop = (data->step_out_frame.is(frame) &&
+               __tracer_sub_language_get_frame_category(data, frame) == -1) ||
+              stop_here_for(data, frame, 2);
   if (stop) {
     PyObject* value = retval != nullptr ? retval : Py_None;
     if (do_callback(gSelf.return_cb.get(), frame, value) != 0)

