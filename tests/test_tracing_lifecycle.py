@@ -1,7 +1,9 @@
 """Switching tracing on and off, containment of failures, injected exceptions, the idle
 callback, autoquit and forked children. Every traced program runs in a subprocess."""
 
+import subprocess
 import sys
+import textwrap
 
 import pytest
 
@@ -322,3 +324,34 @@ def test_reset_keeps_the_line_callback(tmp_path):
                         default="continue_run"))
     assert_stops(run.stops, [("line", "prog.py", 1, "<module>"),
                              ("line", "prog.py", 2, "<module>")])
+
+
+def test_the_thread_hooks_callback_is_not_traced(tmp_path):
+    # start_trace calls install_thread_hooks_cb(1) once tracing is on for the calling thread:
+    # with a step pending, nothing may stop inside the server side's callback.
+    script = tmp_path / "hooks.py"
+    script.write_text(textwrap.dedent("""
+        import builtins, threading
+        import tvantrel30pydebugstackless as core
+        stops, flags = [], []
+        def hooks(flag):
+            flags.append(flag)
+            threading.settrace(core.bootstrap_new_thread if flag else None)
+        def line_cb(frame, changed):
+            stops.append(frame.f_code.co_name)
+            core.continue_run()
+        def program():
+            return 1
+        core.init(0.0, 0, hooks, lambda: None, line_cb, lambda f, v, c: core.continue_run(),
+                  lambda f, e, c: core.continue_run(), lambda: None, None, builtins.__import__,
+                  None, {})
+        core.step_into()
+        core.start_trace()
+        program()
+        core.stop_trace()
+        print(flags, stops)
+    """))
+    proc = subprocess.run([sys.executable, str(script)], capture_output=True, text=True,
+                          timeout=60)
+    assert proc.returncode == 0, proc.stderr
+    assert proc.stdout == "[1, 0] ['<module>']\n"

@@ -188,7 +188,12 @@ void install_start_thread_hooks(int flag) {
   if (!args) {
     PyErr_SetString(PyExc_MemoryError, "Out of memory");
   } else if (gSelf.install_thread_hooks_cb) {
+    // The server side's own code is never traced: start_trace calls this once tracing is
+    // already on for the calling thread, which would otherwise stop inside the callback.
+    PyThreadState* ts = compat::current_tstate();
+    compat::tracing_add(ts, 1);
     Ref result = Ref::steal(PyObject_CallObject(gSelf.install_thread_hooks_cb.get(), args.get()));
+    compat::tracing_add(ts, -1);
   }
   // The server side's failures here are not the caller's business: log and drop them.
   if (PyErr_Occurred() != nullptr) {
