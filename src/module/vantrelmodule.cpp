@@ -159,31 +159,6 @@ PyMethodDef gMethods[] = {
     METHOD("get_file_breaks", _tracer_get_file_breaks,
            "Get all breakpoints in given file: Returns sequence of (lineno, id\nenabled, "
            "temporary, cond, ignore_count, hit_count) tuples"),
-    METHOD("add_to_tstate_tracing", add_to_tstate_tracing,
-           "Adds given value to tracing field of the current thread state.  The trace function "
-           "will be called only if tracing == 0.  value can be < 0."),
-    METHOD("get_tstate_tracing", get_tstate_tracing,
-           "Returns current value of tracing field of the current thread state.  The trace "
-           "function will be called only if tracing == 0."),
-    METHOD("set_tstate_use_tracing", set_tstate_use_tracing,
-           "Set value of use_tracing field of the current thread state.  The trace & profile "
-           "functions will be called only if use_tracing != 0.  The field was add in Python 2.3; "
-           "this does nothing in Python 2.0 & 2.1."),
-    METHOD("get_tstate_use_tracing", get_tstate_use_tracing,
-           "Returns current value of use_tracing field of the current thread state.  The trace & "
-           "profile functions will be called only if use_tracing != 0. The field was add in "
-           "Python 2.3; this always returns 1 in Python 2.0 & 2.1."),
-    METHOD("acquire_selvane_mutex", _tracer_acquire_selvane_mutex,
-           "take the mutex that lets only one thread call into the debug server"),
-    METHOD("release_selvane_mutex", _tracer_release_selvane_mutex, "release that mutex"),
-    METHOD("locals_to_fast", locals_to_fast,
-           "Call LocalsToFast on given frame so changes made in the frame locals dict get\nput "
-           "back into the real locals dict"),
-    METHOD("get_frame_file", get_frame_file,
-           "Returns the filename associated with the given frame"),
-    METHOD("get_current_tstate_id", get_current_tstate_id, "Returns id of current thread state"),
-    METHOD("get_thread_ident_for_tstate_id", get_thread_ident_for_tstate_id,
-           "Returns id returned by thread.get_ident for given tstate_id"),
     METHOD("set_exception_mode", _tracer_set_exception_mode,
            "Set exception mode to use : One of kExcNeverStop=0 to never stop\non exceptions, "
            "kExcAlwaysStop=1 to always stop on exceptions,\nor kExcUnhandledStop=2 to only stop "
@@ -228,11 +203,38 @@ PyMethodDef gMethods[] = {
     METHOD("set_import_cb", _tracer_set_import_cb,
            "Set the callback called when a module is imported (may be None)"),
     METHOD("register_module", _tracer_register_module, "Register module with the debugger"),
+    // register_sub_language_hook, sub_language_get_active_hook, sub_language_get_frame_category
+    METHOD("add_to_tstate_tracing", add_to_tstate_tracing,
+           "Adds given value to tracing field of the current thread state.  The trace function "
+           "will be called only if tracing == 0.  value can be < 0."),
+    METHOD("get_tstate_tracing", get_tstate_tracing,
+           "Returns current value of tracing field of the current thread state.  The trace "
+           "function will be called only if tracing == 0."),
+    METHOD("set_tstate_use_tracing", set_tstate_use_tracing,
+           "Set value of use_tracing field of the current thread state.  The trace & profile "
+           "functions will be called only if use_tracing != 0.  The field was add in Python 2.3; "
+           "this does nothing in Python 2.0 & 2.1."),
+    METHOD("get_tstate_use_tracing", get_tstate_use_tracing,
+           "Returns current value of use_tracing field of the current thread state.  The trace & "
+           "profile functions will be called only if use_tracing != 0. The field was add in "
+           "Python 2.3; this always returns 1 in Python 2.0 & 2.1."),
+    METHOD("acquire_selvane_mutex", _tracer_acquire_selvane_mutex,
+           "take the mutex that lets only one thread call into the debug server"),
+    METHOD("release_selvane_mutex", _tracer_release_selvane_mutex, "release that mutex"),
     METHOD("raise_exception", raise_exception,
            "Raise given exception in the thread at the next opportunity"),
+    METHOD("locals_to_fast", locals_to_fast,
+           "Call LocalsToFast on given frame so changes made in the frame locals dict get\nput "
+           "back into the real locals dict"),
+    METHOD("get_frame_file", get_frame_file,
+           "Returns the filename associated with the given frame"),
+    METHOD("get_current_tstate_id", get_current_tstate_id, "Returns id of current thread state"),
+    METHOD("get_thread_ident_for_tstate_id", get_thread_ident_for_tstate_id,
+           "Returns id returned by thread.get_ident for given tstate_id"),
     METHOD("is_internal_frame", _tracer_is_internal_frame,
            "Returns id returned by thread.get_ident for given tstate_id"),
     METHOD("get_changed_bps_lists", get_changed_bps_lists, "Gets and clears the changed bp lists."),
+    // WaitForInput, CopyIntoBuffer
     METHOD("PyFrame_LocalsToFast", wrap_PyFrame_LocalsToFast,
            "Wrapper around PyFrame_LocalsToFast internal api call."),
     // The trace function, the thread hooks and __import__ carry no docstring.
