@@ -308,6 +308,24 @@ int register_function_code(PyObject* frame) {
   return 0;
 }
 
+// Calls the line callback for a stop at `frame`. Only a stop runs Python code: the thread's
+// exception state is kept around it, and a failing callback's error is what the interpreter
+// reports. 0, or -1 when the callback failed.
+int line_stop(PyObject* frame) {
+  compat::PendingError saved;
+  saved.fetch();
+  if (do_callback(gSelf.line_cb.get(), frame, nullptr) == 0) {
+    saved.restore();
+    return 0;
+  }
+  compat::PendingError failure;
+  failure.fetch();
+  saved.restore();
+  PyErr_Clear();
+  failure.restore();
+  return -1;
+}
+
 }  // namespace
 
 int dispatch_call(ThreadData* data, PyObject* frame) {
@@ -322,6 +340,13 @@ int dispatch_call(ThreadData* data, PyObject* frame) {
     if (__tracer_top_level_call(frame) != 0) return -2;
   }
   if (data->bot_frame.is_none()) data->bot_frame = Ref::borrow(frame);
+  // Entering a key frame is a step of the sub-language program: its hook may stop there.
+  __tracer_sub_language_dispatch_call(data, frame);
+  // (While the import callback runs nothing stops.)
+  if (data->sub_language_hook && !gSelf.in_import_cb &&
+      __tracer_sub_language_stop_here(data, frame, 0)) {
+    return line_stop(frame);
+  }
   return 0;
 }
 
@@ -338,20 +363,7 @@ int dispatch_line(ThreadData* data, PyObject* frame) {
       !__tracer_break_here(&gSelf.bp_ops_data, 1, data, frame, 1)) {
     return 0;
   }
-  // Only a stop runs Python code: the thread's exception state is kept around it, and a
-  // failing callback's error is what the interpreter reports.
-  compat::PendingError saved;
-  saved.fetch();
-  if (do_callback(gSelf.line_cb.get(), frame, nullptr) == 0) {
-    saved.restore();
-    return 0;
-  }
-  compat::PendingError failure;
-  failure.fetch();
-  saved.restore();
-  PyErr_Clear();
-  failure.restore();
-  return -1;
+  return line_stop(frame);
 }
 
 namespace {
@@ -385,7 +397,8 @@ int forget_exception_of(PyObject* frame, int result) {
 }
 }  // namespace
 
-int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
+namespace {
+int decide_return(ThreadData* data, PyObject* frame, PyObject* retval) {
   if (!gSelf.trace_started) return -1;
   if (retval == nullptr) {
     // Left by an exception: the latest exception event in the frame says which one.
@@ -412,6 +425,14 @@ int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
     if (untraced_after_stop(frame)) return 0;
   }
   return forget_exception_of(frame, 0);
+}
+}  // namespace
+
+int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
+  int result = decide_return(data, frame, retval);
+  // Whichever way the frame is left, a marker frame takes its sub-language with it.
+  __tracer_sub_language_dispatch_return(data, frame);
+  return result;
 }
 
 int do_callback(PyObject* cb, PyObject* frame, PyObject* arg) {

@@ -6,6 +6,7 @@
 
 #include "bp/bpops.h"
 #include "core/install.h"
+#include "core/sublang.h"
 #include "core/tracercore.h"
 #include "names/conames.h"
 #include "support/dbgcommon.h"
@@ -148,8 +149,14 @@ void __call_import_cb(PyObject* module) {
     DLOGEXCEPTION();
     PyErr_Clear();
   }
+  // Imports bring new key functions: the active hook's key frames are read again.
+  ThreadData* data = find_thread_data(&s.thread_table, compat::current_tstate());
+  if (data != nullptr && data->sub_language_hook) {
+    PinnedThreadData pin(data);
+    Ref hook = data->sub_language_hook;
+    __tracer_load_sub_language_frames(hook.get());
+  }
   saved.restore();
-  // Reloading the active sub-language hook's frame lists joins with the hooks themselves.
   s.in_import_cb = 0;
 }
 

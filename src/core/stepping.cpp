@@ -3,6 +3,7 @@
 #include "core/stepping.h"
 
 #include "bp/breakhere.h"
+#include "core/sublang.h"
 #include "core/tracercore.h"
 #include "support/dbgcommon.h"
 #include "support/dprintf.h"
@@ -79,6 +80,14 @@ namespace {
 
 // The thread's stepping state decides (the sub-language hook, once there is one, first).
 int decide_stop(ThreadData* data, PyObject* frame, int event) {
+  if (data->sub_language_hook) {
+    if (__tracer_sub_language_stop_here(data, frame, event)) return 1;
+    // The implementation's own frames never stop; a failed lookup counts as one of them.
+    if (__tracer_sub_language_in_impl(data, frame) != 0) {
+      PyErr_Clear();
+      return 0;
+    }
+  }
   if (!data->stop_frame) {
     do_dprintf(kDbgFlow, "Not stopping here because stop_frame == NULL\n");
     return 0;
@@ -126,8 +135,15 @@ void __tracer_step_over_line_range(ThreadData* data, int first, int last) {
 }
 
 int __tracer_step_out(ThreadData* data) {
-  Ref target = frame_back(data->curr_frame.get());
-  if (!target) target = Ref::none();
+  Ref target;
+  if (data->sub_language_hook) {
+    // The sub-language says where its step-out ends; if it cannot, nothing changes.
+    target = Ref::steal(__tracer_sub_language_step_out_frame(data, data->curr_frame.get()));
+    if (!target) return 0;
+  } else {
+    target = frame_back(data->curr_frame.get());
+    if (!target) target = Ref::none();
+  }
   set_stepping(data, target, data->curr_frame, -1, -1);
   return 1;
 }

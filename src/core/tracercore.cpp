@@ -91,6 +91,9 @@ int init_tracercore() {
   gSelf.file_ops_data = create_file_ops_data();
   if (gSelf.file_ops_data == nullptr) return -1;
   InitCOPathnameTable(&gSelf.co_pathname_table, gSelf.file_ops_data);
+  __tracer_init_sub_language_state(&gSelf.sub_language);
+  // The sub-language implementation cache is keyed by code address, as the table is.
+  gSelf.co_pathname_table.code_released = __tracer_sub_language_forget_code;
   return 0;
 }
 

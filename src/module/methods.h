@@ -66,6 +66,9 @@ PyObject* set_exc_catch_info_list(PyObject* self, PyObject* args);
 PyObject* _tracer_get_new_imports(PyObject* self, PyObject* args);
 PyObject* _tracer_set_import_cb(PyObject* self, PyObject* args);
 PyObject* _tracer_register_module(PyObject* self, PyObject* args);
+PyObject* _tracer_register_sub_language_hook(PyObject* self, PyObject* args);
+PyObject* _tracer_sub_language_get_active_hook(PyObject* self, PyObject* args);
+PyObject* _tracer_sub_language_get_frame_category(PyObject* self, PyObject* args);
 PyObject* _tracer_import(PyObject* self, PyObject* args, PyObject* kwargs);
 
 // bp_methods.cpp: breakpoints.

@@ -87,6 +87,7 @@ PyObject* _tracer_step_over_line_range(PyObject*, PyObject* args) {
 PyObject* _tracer_step_out(PyObject*, PyObject*) {
   ThreadData* data = calling_thread_record();
   if (data == nullptr) return nullptr;
+  PinnedThreadData pin(data);  // a sub-language hook's step-out target is its own code
   if (!__tracer_step_out(data)) return nullptr;
   Py_RETURN_NONE;
 }

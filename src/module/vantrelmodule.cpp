@@ -203,7 +203,16 @@ PyMethodDef gMethods[] = {
     METHOD("set_import_cb", _tracer_set_import_cb,
            "Set the callback called when a module is imported (may be None)"),
     METHOD("register_module", _tracer_register_module, "Register module with the debugger"),
-    // register_sub_language_hook, sub_language_get_active_hook, sub_language_get_frame_category
+    METHOD("register_sub_language_hook", _tracer_register_sub_language_hook,
+           "Register a sub-language extension with the debugger"),
+    METHOD("sub_language_get_active_hook", _tracer_sub_language_get_active_hook,
+           "Get the active sub language hook in the given thread.  Returns None\nwhen no "
+           "sub-language implementation is active on the thread's stack."),
+    METHOD("sub_language_get_frame_category", _tracer_sub_language_get_frame_category,
+           "Get the type of the given frame:  Returns 1 if it's a key frame in the "
+           "active\nsub-language implementation, 0 if it's a frame that should be hidden "
+           "because it\nis part of the sub-language implementation but not a key frame, and -1 "
+           "for\nunknown frames."),
     METHOD("add_to_tstate_tracing", add_to_tstate_tracing,
            "Adds given value to tracing field of the current thread state.  The trace function "
            "will be called only if tracing == 0.  value can be < 0."),

@@ -51,6 +51,7 @@ void collect_unreferenced(PyObject* dict, SweepBatch* batch) {
 void release_batch(COPathnameTable* table, PyObject* dict, SweepBatch* batch) {
   for (int i = 0; i < batch->count; ++i) {
     table->address_index.erase(batch->codes[i]);
+    if (table->code_released != nullptr) table->code_released(batch->codes[i]);
     if (PyDict_DelItem(dict, batch->keys[i].get()) < 0) {
       do_dprintf(kDbgPathnames,
                  "FATAL ERROR: UNEXPECTED EXCEPTION in conames.c, CollectGarbage "
@@ -165,6 +166,7 @@ void ClearCOPathnameTable(COPathnameTable* table) {
   // Detached first: releasing a code object may run code that looks at the table.
   Ref dict = std::move(table->dict);
   table->address_index.clear();
+  if (table->code_released != nullptr) table->code_released(nullptr);
   if (!dict) return;
   Py_ssize_t pos = 0;
   PyObject* key = nullptr;

@@ -29,6 +29,9 @@ struct COPathnameTable {
   // Code object address -> the text of its path bytes in `dict` (borrowed from the entry).
   // Answers a lookup with one hash probe and no allocation; kept in step with `dict`.
   std::unordered_map<const PyObject*, const char*> address_index;
+  // Told when the table lets a code object go (null: all of them), before its reference is
+  // dropped: caches keyed by code address must forget it, as the address may be reused.
+  void (*code_released)(const PyObject* code) = nullptr;
 };
 
 void InitCOPathnameTable(COPathnameTable* table, FileOpsData* file_ops);
