@@ -35,6 +35,13 @@ def _parser():
     parser.add_argument("--skip-thread", action="append", default=[], metavar="PATTERN",
                         help="do not debug threads whose name matches this pattern "
                         "(repeatable)")
+    parser.add_argument("--sub-language", action="append", default=[],
+                        metavar="MODULE:OBJECT",
+                        help="register a sub-language hook (a template language, say) before "
+                        "the program runs, so that its files take breakpoints and its lines "
+                        "are stepped through: OBJECT is the hook, or a class or factory "
+                        "called without arguments to make it; MODULE is imported with the "
+                        "program's folder on the path (repeatable)")
     parser.add_argument("--no-stop-at-start", action="store_true",
                         help="run to the first breakpoint instead of stopping before the "
                         "first line")
@@ -47,7 +54,8 @@ def _split(argv):
     """Options are ours up to the script (or -m MODULE); everything after is the program's."""
     ours = []
     i = 0
-    takes_value = {"-c", "--command", "--break", "--exceptions", "--skip-thread"}
+    takes_value = {"-c", "--command", "--break", "--exceptions", "--skip-thread",
+                   "--sub-language"}
     while i < len(argv):
         arg = argv[i]
         if arg == "-m":
@@ -81,7 +89,7 @@ def main(argv=None):
 
     from .console import Console, Terminal
     from .runner import Program, ProgramError, run
-    from .session import Session, SessionError
+    from .session import Session, SessionError, load_sub_language_hook
 
     program = Program(target[1], program_args, is_module=target[0] == "module")
     try:
@@ -97,6 +105,13 @@ def main(argv=None):
                       debug_all_threads=not options.one_thread,
                       skip_threads=options.skip_thread)
     session.main_file = program.file
+    for spec in options.sub_language:
+        try:
+            session.register_sub_language_hook(_hook_for(spec, program,
+                                                         load_sub_language_hook))
+        except SessionError as error:
+            print(f"python -m selvane: --sub-language {spec}: {error}", file=sys.stderr)
+            return 2
     for location in options.breaks:
         try:
             bp = session.add_breakpoint(location)
@@ -114,6 +129,18 @@ def main(argv=None):
     session.finish()
     console.say(f"The program exited with status {status}.")
     return status
+
+
+def _hook_for(spec, program, load):
+    """Loads a hook as the program would import it: its folder first on the path."""
+    added = program.path0 is not None and program.path0 not in sys.path
+    if added:
+        sys.path.insert(0, program.path0)
+    try:
+        return load(spec)
+    finally:
+        if added:
+            sys.path.remove(program.path0)
 
 
 if __name__ == "__main__":

@@ -163,7 +163,7 @@ class Console(cmd.Cmd, Frontend):
         if stop.reason == "interrupted":
             self.say("")  # past the ^C that the terminal echoed
         self.say(header)
-        self.say(f"-> {_source(stop.frame)}")
+        self.say(f"-> {self._source(stop.frame)}")
         for bp in stop.deleted:
             self.say(f"(temporary breakpoint {bp.number} deleted)")
         if stop.kind == "return":
@@ -181,8 +181,14 @@ class Console(cmd.Cmd, Frontend):
                 self.say("   (not caught: the thread ends with it)")
 
     def _where(self, frame):
-        return f"{_show_path(frame.f_code.co_filename)}:{frame.f_lineno} in " \
-               f"{frame.f_code.co_name}()"
+        place = self.session.place(frame)
+        if place.sub_language:  # a template line (or another sub-language's step)
+            return f"{_show_path(place.file)}:{place.line}"
+        return f"{_show_path(place.file)}:{place.line} in {place.function}()"
+
+    def _source(self, frame, line=None):
+        text = self.session.source(frame, line)
+        return text if text is not None else "<no source>"
 
     # ---- command parsing -------------------------------------------------------------------
 
@@ -305,7 +311,7 @@ class Console(cmd.Cmd, Frontend):
         line = _int_arg(arg, "jump")
         self.session.jump(line)
         self.say(f"next line: {line}")
-        self.say(f"-> {_source(self.session.frame, line)}")
+        self.say(f"-> {self._source(self.session.frame, line)}")
 
     def do_quit(self, arg):
         """quit (q, exit): end the debugger and the program at once."""
@@ -322,7 +328,7 @@ class Console(cmd.Cmd, Frontend):
         for frame in session.stack():
             mark = ">" if frame is session.frame else " "
             self.say(f"{mark} {self._where(frame)}")
-            self.say(f"    -> {_source(frame)}")
+            self.say(f"    -> {self._source(frame)}")
 
     do_w = do_bt = do_where
 
@@ -331,7 +337,7 @@ class Console(cmd.Cmd, Frontend):
         frame = self.session.move(direction * count)
         self._list_next = None
         self.say(f"> {self._where(frame)}")
-        self.say(f"-> {_source(frame)}")
+        self.say(f"-> {self._source(frame)}")
 
     def do_up(self, arg):
         """up (u) [COUNT]: select the frame that called this one."""
@@ -347,7 +353,8 @@ class Console(cmd.Cmd, Frontend):
         """list (l) [FIRST[, LAST]]: source lines around the current line, or from FIRST;
         `list` again goes on after what was shown."""
         frame = self.session.frame
-        path = frame.f_code.co_filename
+        place = self.session.place(frame)
+        path = place.file
         arg = arg.strip()
         if arg:
             parts = [p.strip() for p in arg.split(",")]
@@ -360,7 +367,7 @@ class Console(cmd.Cmd, Frontend):
             first = self._list_next[1]
             last = first + 10
         else:
-            first = max(1, frame.f_lineno - 5)
+            first = max(1, place.line - 5)
             last = first + 10
         self._show_lines(frame, first, last)
         self._list_next = (path, last + 1)
@@ -371,8 +378,12 @@ class Console(cmd.Cmd, Frontend):
         """longlist (ll): the whole source of the current function."""
         import inspect
         frame = self.session.frame
+        place = self.session.place(frame)
         try:
-            if frame.f_code.co_name == "<module>":
+            if place.sub_language:  # the whole template
+                lines = linecache.getlines(place.file)
+                first = 1
+            elif frame.f_code.co_name == "<module>":
                 lines = linecache.getlines(frame.f_code.co_filename, frame.f_globals)
                 first = 1
             else:
@@ -385,15 +396,18 @@ class Console(cmd.Cmd, Frontend):
     do_ll = do_longlist
 
     def _show_lines(self, frame, first, last):
-        path = frame.f_code.co_filename
-        marks = self.session.breakpoint_lines(os.path.abspath(path))
+        place = self.session.place(frame)
+        path = place.file
+        marks = self.session.breakpoint_lines(path if place.sub_language
+                                              else os.path.abspath(path))
         shown = False
         for line in range(first, last + 1):
-            text = linecache.getline(path, line, frame.f_globals)
+            text = linecache.getline(path, line,
+                                     None if place.sub_language else frame.f_globals)
             if not text:
                 break
             shown = True
-            mark = "->" if line == frame.f_lineno else "  "
+            mark = "->" if line == place.line else "  "
             bp = "B" if line in marks else " "
             self.say(f"{line:4d} {bp}{mark} {text.rstrip()}")
         if not shown:
@@ -424,11 +438,12 @@ class Console(cmd.Cmd, Frontend):
         self.say(form(value))
 
     def do_locals(self, arg):
-        """locals: the local variables of the selected frame."""
+        """locals: the local variables of the selected frame (a template's variables at a
+        template line)."""
         frame = self.session.frame
+        names = self.session.local_variables(frame)
         if frame.f_code.co_name == "<module>":
             self.say("(module level: the names are its globals)")
-        names = dict(frame.f_locals)
         for name in sorted(names):
             if name.startswith("__") and name.endswith("__"):
                 continue
@@ -598,7 +613,7 @@ class Console(cmd.Cmd, Frontend):
         info = self.session.select_thread(_int_arg(arg, "thread"))
         self._list_next = None
         self.say(f"[{info.name}] > {self._where(info.frame)}")
-        self.say(f"-> {_source(info.frame)}")
+        self.say(f"-> {self._source(info.frame)}")
 
 
 def _int_arg(text, what):
@@ -606,12 +621,6 @@ def _int_arg(text, what):
         return int(text.strip())
     except ValueError:
         raise SessionError(f"{what}: expected a number, not {text.strip()!r}") from None
-
-
-def _source(frame, line=None):
-    line = frame.f_lineno if line is None else line
-    text = linecache.getline(frame.f_code.co_filename, line, frame.f_globals)
-    return text.strip() if text else "<no source>"
 
 
 def _exception_text(exc_type, value):

@@ -8,6 +8,12 @@ core's changed-breakpoint lists), the exception settings and the threads. A fron
 implements `Frontend` (the console does; an editor protocol could) and calls the session's
 methods; it never calls the core itself.
 
+Sub-languages (template languages and the like, implemented in Python) are shown through
+their hooks, registered with `register_sub_language_hook`: a key frame (one step of the
+sub-language program) is shown at the file and line the hook translates it to, evaluates
+expressions with the hook, and takes breakpoints set in the sub-language's files; frames of
+the implementation are hidden from the stack and never shown as stops.
+
 Threading: the core calls the callbacks in the stopped thread while holding its mutex; the
 other traced threads wait at that mutex. The front end's `stopped()` runs there, and the
 resume command it chose is given to the core (which acts on the calling thread's record)
@@ -18,6 +24,8 @@ thread names are read from the threading module's table without its lock.
 import builtins
 import dis
 import fnmatch
+import functools
+import importlib
 import linecache
 import os
 import signal
@@ -28,7 +36,7 @@ from dataclasses import dataclass, field
 import tvantrel30pydebugstackless as core
 
 from . import handlers
-from . import _ORIGINAL_IMPORT
+from . import _ORIGINAL_IMPORT, _PROGRAM_HOOKS, HOOK_METHODS, check_hook
 from .catchinfo import DEFAULT_PRINTING_HANDLERS
 
 EXCEPTION_MODES = {"never": 0, "always": 1, "unhandled": 2, "printed": 4}
@@ -37,6 +45,8 @@ EXCEPTION_MODES = {"never": 0, "always": 1, "unhandled": 2, "printed": 4}
 DEFAULT_NEVER_STOP = (SystemExit, StopIteration, StopAsyncIteration, GeneratorExit)
 _HERE = os.path.dirname(os.path.abspath(__file__))
 _IDLE_PERIOD = 0.2
+# Frame categories of the core: a sub-language's key frame, a frame of its implementation.
+KEY_FRAME, IMPLEMENTATION_FRAME = 1, 0
 
 
 class SessionError(Exception):
@@ -68,6 +78,19 @@ class Stop:
     reason: str = None  # "breakpoint N", "interrupted", or None (stepping, start)
     deleted: list = field(default_factory=list)  # temporary breakpoints that fired
     inner: object = None  # the frame where the exception was raised
+
+
+@dataclass
+class Place:
+    """Where a frame stands, as the person debugging sees it: a Python file, line and
+    function, or a sub-language's file and line (`function` None) for a key frame."""
+    file: str  # absolute path, or a name such as "<string>"
+    line: int
+    function: str = None
+
+    @property
+    def sub_language(self):
+        return self.function is None
 
 
 @dataclass
@@ -133,7 +156,12 @@ class Session:
         self._saved_sigint = None
         self._at_prompt = False
         self._new_imports = []
+        self.sub_language_hooks = []
         self._init_core(exceptions, autoquit, debug_all_threads)
+        global _current
+        _current = self
+        for hook in _PROGRAM_HOOKS:  # registered by the program before this session began
+            self.register_sub_language_hook(hook)
 
     # ---- the core --------------------------------------------------------------------------
 
@@ -271,6 +299,17 @@ class Session:
             else:
                 core.continue_run()
             return
+        if self.sub_language_hooks:
+            category = self.frame_category(stop.frame, ident)
+            if category == IMPLEMENTATION_FRAME:
+                # A sub-language's implementation is never shown: the stepping in force
+                # goes on as it was (the core stops there only to report an exception of a
+                # key frame again as it passes through).
+                return
+            if category == KEY_FRAME and stop.kind == "exception" \
+                    and self._last_resume.get(ident) in (None, "continue_run") \
+                    and not self._sub_language_exception_stops(stop):
+                return
         interrupted = ident in self._stop_requested
         self._stop_requested.discard(ident)
         last = self._last_resume.get(ident)
@@ -330,12 +369,32 @@ class Session:
     def _is_internal(self, frame):
         return frame.f_code.co_filename in self.own_files
 
+    def _sub_language_exception_stops(self, stop):
+        """Whether an exception raised by a key frame stops the program that runs freely.
+        The core asks the hook about such an exception in the same terms whether the
+        program steps or runs freely, so a hook that reports its exceptions has every one
+        of them stop; this applies the exception settings to it as the core applies them to
+        Python frames."""
+        exc_type = stop.exc[0]
+        mode = core.get_exception_mode()
+        if mode == EXCEPTION_MODES["always"]:
+            return True
+        if _matches(exc_type, core.get_never_stop_excepts()):
+            return False
+        if _matches(exc_type, core.get_always_stop_excepts()):
+            return True
+        if mode == EXCEPTION_MODES["never"]:
+            return False
+        return handlers.find_handler(stop.frame, exc_type, self.ignored_codes) is None
+
     def _apply_changed(self, changed, stop):
         """Brings the breakpoint table up to date; answers the breakpoint of this stop's line
         that was hit, if any."""
         deleted, updated = changed if changed else ((), ())
         hit = None
-        here = (os.path.abspath(stop.frame.f_code.co_filename), stop.frame.f_lineno)
+        place = self.place(stop.frame, stop.thread)
+        here = (os.path.abspath(place.file) if not place.sub_language else place.file,
+                place.line)
         for data in updated:
             _file, line, core_id, enabled, temporary, cond, ignore, hits = data
             number = self._core_ids.get(core_id)
@@ -390,6 +449,9 @@ class Session:
     def until(self, line=None):
         """Runs until a line below `line` (default: the current line) is passed in the
         current frame, or the frame returns."""
+        if self.stop is not None and self._key_hook(self.stop.frame) is not None:
+            raise SessionError("until works in Python code; `next` steps over a template "
+                               "line")
         current = self.stop.frame.f_lineno
         last = current if line is None else line - 1
         if line is not None and line <= current:
@@ -410,6 +472,8 @@ class Session:
         if stop.kind != "line":
             raise SessionError("can only jump at a line stop, not at a "
                                f"{stop.kind} stop")
+        if self._key_hook(stop.frame) is not None:
+            raise SessionError("cannot jump in a sub-language's code, only in Python code")
         try:
             stop.frame.f_lineno = line
         except ValueError as error:
@@ -423,10 +487,11 @@ class Session:
         frame = frame if frame is not None else self._innermost()
         frames = []
         while frame is not None:
-            if not self._is_internal(frame):
+            if self._is_internal(frame):
+                if frames:
+                    break  # the debugger's runner: what lies beyond it is not the program's
+            elif self.frame_category(frame) != IMPLEMENTATION_FRAME:
                 frames.append(frame)
-            elif frames:
-                break  # the debugger's runner: what lies beyond it is not the program's
             frame = frame.f_back
         frames.reverse()
         return frames
@@ -439,8 +504,15 @@ class Session:
     def _thread_frame(self, ident):
         for tid in core.get_threads():
             if core.get_thread_ident_for_tstate_id(tid) == ident:
-                return core.get_curr_frame(tid)
+                return self._visible(core.get_curr_frame(tid), ident)
         return None
+
+    def _visible(self, frame, ident):
+        """The frame itself, or the nearest caller that is not a sub-language's
+        implementation (where another thread may be running)."""
+        while frame is not None and self.frame_category(frame, ident) == IMPLEMENTATION_FRAME:
+            frame = frame.f_back
+        return frame
 
     def move(self, count):
         """Selects the frame `count` levels out (positive) or in (negative)."""
@@ -468,7 +540,8 @@ class Session:
             seen.add(ident)
             number = self._thread_numbers.setdefault(ident, len(self._thread_numbers) + 1)
             stopped = self.stop is not None and ident == self.stop.thread
-            frame = self.stop.frame if stopped else core.get_curr_frame(tid)
+            frame = self.stop.frame if stopped else self._visible(core.get_curr_frame(tid),
+                                                                   ident)
             if frame is not None and self._is_internal(frame):
                 frame = None
             result.append(ThreadInfo(number, ident, active[ident].name, frame, stopped))
@@ -513,7 +586,9 @@ class Session:
             if file:
                 path = self.resolve_file(file.strip())
             elif self.frame is not None:
-                path = os.path.abspath(self.frame.f_code.co_filename)
+                path = self.place(self.frame).file
+                if not self.place(self.frame).sub_language:
+                    path = os.path.abspath(path)
             elif self.main_file:
                 path = self.main_file
             else:
@@ -547,14 +622,14 @@ class Session:
         source = linecache.getline(path, line)
         if not source:
             raise SessionError(f"{_show_path(path)} has no line {line}")
-        stripped = source.strip()
-        if not stripped or stripped.startswith("#"):
-            raise SessionError(f"line {line} of {_show_path(path)} is blank or a comment")
-        if condition is not None:
-            try:
-                compile(condition, "<condition>", "eval")
-            except SyntaxError as error:
-                raise SessionError(f"bad condition {condition!r}: {error.msg}") from None
+        # Any other file is a sub-language's (a template): the core compares its name, as
+        # given here, with the hook's translation of key frames, and the hook evaluates its
+        # conditions in the sub-language's own terms.
+        if _is_python_file(path):
+            stripped = source.strip()
+            if not stripped or stripped.startswith("#"):
+                raise SessionError(f"line {line} of {_show_path(path)} is blank or a comment")
+            _check_condition(condition)
         for bp in self.breakpoints.values():
             if (bp.file, bp.line) == (path, line):
                 raise SessionError(f"breakpoint {bp.number} is already at "
@@ -589,11 +664,8 @@ class Session:
 
     def set_condition(self, number, condition):
         bp = self.breakpoint(number)
-        if condition:
-            try:
-                compile(condition, "<condition>", "eval")
-            except SyntaxError as error:
-                raise SessionError(f"bad condition {condition!r}: {error.msg}") from None
+        if condition and _is_python_file(bp.file):
+            _check_condition(condition)
         core.set_breaks_cond(bp.file, bp.line, condition or None)
         bp.condition = condition or None
         return bp
@@ -666,9 +738,13 @@ class Session:
         if stop is None or stop.kind != "exception":
             raise SessionError("not stopped at an exception")
         inner = stop.inner
-        path = core.get_frame_file(inner)
-        core.ignore_exception_loc(path, inner.f_lineno, 1)
-        return path, inner.f_lineno
+        place = self.place(inner)
+        if place.sub_language:  # the core filters a key frame's exceptions by its translation
+            path, line = place.file, place.line
+        else:
+            path, line = core.get_frame_file(inner), inner.f_lineno
+        core.ignore_exception_loc(path, line, 1)
+        return path, line
 
     # ---- evaluation ------------------------------------------------------------------------
 
@@ -679,7 +755,11 @@ class Session:
         return frame.f_globals, frame.f_locals
 
     def evaluate(self, expression, frame=None):
-        """The value of an expression in the selected frame; its exceptions propagate."""
+        """The value of an expression in the selected frame; its exceptions propagate. At a
+        sub-language's key frame the hook evaluates it, in the sub-language's variables."""
+        hook = self._key_hook(frame if frame is not None else self.frame)
+        if hook is not None:
+            return hook._Eval(expression, frame if frame is not None else self.frame)
         globals_, locals_ = self.namespaces(frame)
         code = compile(expression, "<selvane>", "eval")
         return eval(code, globals_, locals_)
@@ -688,6 +768,9 @@ class Session:
         """Runs a statement in the selected frame; assignments to local variables reach the
         running function."""
         frame = frame if frame is not None else self.frame
+        if self._key_hook(frame) is not None:
+            raise SessionError("statements cannot run in a sub-language's variables; "
+                               "`p EXPRESSION` evaluates there")
         globals_, locals_ = self.namespaces(frame)
         code = compile(statement + "\n", "<selvane>", "single")
         try:
@@ -698,11 +781,177 @@ class Session:
                 core.locals_to_fast(frame)
 
     def names(self, frame=None):
+        frame = frame if frame is not None else self.frame
+        if self._key_hook(frame) is not None:
+            try:
+                return set(self.local_variables(frame)) | set(dir(builtins))
+            except SessionError:
+                return set(dir(builtins))
         globals_, locals_ = self.namespaces(frame)
         return set(locals_) | set(globals_) | set(dir(builtins))
 
+    def local_variables(self, frame=None):
+        """The variables of the frame: its locals, or at a key frame the sub-language's
+        variables when its hook can tell them (a method `variables(frame)`)."""
+        frame = frame if frame is not None else self.frame
+        if frame is None:
+            raise SessionError("no frame to show")
+        hook = self._key_hook(frame)
+        if hook is None:
+            return dict(frame.f_locals)
+        variables = getattr(hook, "variables", None)
+        if variables is None:
+            raise SessionError("this sub-language's hook does not list its variables; "
+                               "`p NAME` shows one")
+        try:
+            return dict(variables(frame))
+        except Exception as error:
+            raise SessionError(f"the sub-language's variables: {_one_line(error)}") from None
+
+    # ---- sub-languages ----------------------------------------------------------------------
+
+    def register_sub_language_hook(self, hook):
+        """Registers a sub-language's hook with the core (once per hook: the core keeps every
+        hook it was given until the session ends)."""
+        try:
+            check_hook(hook)
+        except TypeError as error:
+            raise SessionError(str(error)) from None
+        if any(known is hook for known in self.sub_language_hooks):
+            return
+        register = getattr(core, "register_sub_language_hook", None)
+        if register is None:
+            raise SessionError("this build of the debugger core has no sub-language support")
+        register(hook)
+        self.sub_language_hooks.append(hook)
+
+    def frame_category(self, frame, ident=None):
+        """KEY_FRAME for a registered sub-language's key frame, IMPLEMENTATION_FRAME for the
+        rest of its implementation while it runs, -1 for every other frame. `ident` is the
+        frame's thread (default: the thread shown)."""
+        if not self.sub_language_hooks or frame is None:
+            return -1
+        tid = self._tstate_id(ident)
+        if tid is None:
+            return -1
+        try:
+            return core.sub_language_get_frame_category(tid, frame)
+        except Exception:
+            return -1
+
+    def place(self, frame, ident=None):
+        """Where the frame stands: its Python place, or for a key frame the hook's
+        translation (the Python place if the hook cannot translate it)."""
+        hook = self._key_hook(frame, ident)
+        if hook is not None:
+            try:
+                file, line = hook._TranslateFrame(frame, 0)[:2]
+                return Place(str(file), int(line))
+            except Exception:
+                pass
+        return Place(frame.f_code.co_filename, frame.f_lineno, frame.f_code.co_name)
+
+    def source(self, frame, line=None):
+        """The text of the frame's line (or of another line of its file), stripped, or
+        None."""
+        place = self.place(frame)
+        line = place.line if line is None else line
+        if place.sub_language:
+            text = linecache.getline(place.file, line)
+        else:
+            text = linecache.getline(place.file, line, frame.f_globals)
+        return text.strip() if text else None
+
+    def _key_hook(self, frame, ident=None):
+        """The hook of the sub-language whose key frame this is, or None."""
+        if frame is None or self.frame_category(frame, ident) != KEY_FRAME:
+            return None
+        for hook in self.sub_language_hooks:
+            try:
+                if frame.f_code in hook._GetSubLanguageFrames():
+                    return hook
+            except Exception:
+                continue
+        tid = self._tstate_id(ident)
+        try:
+            return core.sub_language_get_active_hook(tid)
+        except Exception:
+            return None
+
+    def _tstate_id(self, ident=None):
+        if ident is None:
+            ident = self.thread if self.thread is not None else threading.get_ident()
+        if ident == threading.get_ident():
+            return core.get_current_tstate_id()
+        for tid in core.get_threads():
+            if core.get_thread_ident_for_tstate_id(tid) == ident:
+                return tid
+        return None
+
     def take_new_imports(self):
         return list(core.get_new_imports())
+
+
+def _is_python_file(path):
+    return path.endswith((".py", ".pyw"))
+
+
+def _check_condition(condition):
+    if condition is not None:
+        try:
+            compile(condition, "<condition>", "eval")
+        except SyntaxError as error:
+            raise SessionError(f"bad condition {condition!r}: {error.msg}") from None
+
+
+def _matches(exc_type, types):
+    try:
+        return bool(types) and issubclass(exc_type, tuple(types))
+    except TypeError:
+        return False
+
+
+def load_sub_language_hook(spec):
+    """A hook named `MODULE:OBJECT` (as --sub-language gives it): the object, or, for a class
+    or a factory, what calling it without arguments answers."""
+    module_name, sep, attribute = spec.partition(":")
+    if not sep or not module_name.strip() or not attribute.strip():
+        raise SessionError(f"expected MODULE:OBJECT, not {spec!r}")
+    try:
+        module = importlib.import_module(module_name.strip())
+    except Exception as error:
+        raise SessionError(f"cannot import {module_name.strip()}: {_one_line(error)}") from None
+    try:
+        value = functools.reduce(getattr, attribute.strip().split("."), module)
+    except AttributeError:
+        raise SessionError(f"module {module_name.strip()} has no {attribute.strip()}") from None
+    if isinstance(value, type) or not all(hasattr(value, name) for name in HOOK_METHODS):
+        if not callable(value):
+            raise SessionError(f"{spec} is neither a sub-language hook nor callable")
+        try:
+            value = value()
+        except Exception as error:
+            raise SessionError(f"{spec}(): {_one_line(error)}") from None
+    try:
+        check_hook(value)
+    except TypeError as error:
+        raise SessionError(str(error)) from None
+    return value
+
+
+_current = None  # the session that initialised the core last
+
+
+def _register_from_program(hook):
+    """selvane.register_sub_language_hook() while this module is loaded: the hook goes to the
+    current session too. A problem of the debugger is told to the person debugging, not
+    raised into the program."""
+    session = _current
+    if session is not None:
+        try:
+            session.register_sub_language_hook(hook)
+        except SessionError as error:
+            session.frontend.message(f"sub-language hook not registered: {error}")
 
 
 def _one_line(error):

@@ -53,6 +53,12 @@ Configuration keys:
                    thread name] to the events
   import_cb_exec   Python source that callback runs after recording (names: core, shared,
                    server, module, threading)
+  sub_languages    list of "module:object" sub-language hooks (an object, or a class called
+                   without arguments) registered after the prelude, before tracing starts.
+                   A stop in a key frame is then recorded at the hook's translation (file
+                   base name, line) with the key function's name; a stop in another frame of
+                   the implementation is recorded with "impl" in place of its line, and
+                   always, whatever "files" says, so that a test sees it
   wait_in          {"thread name": seconds}: that thread's first recorded stop waits up to
                    that long for shared.go (a threading.Event the program sets) and records
                    whether it came; then probe_after (an expression like probe) is recorded
@@ -113,6 +119,7 @@ class Server:
         self.frame = None  # the frame of the stop being answered
         self.debug_file = None
         self.changed = _NOTHING  # the changed-breakpoint lists of the stop being answered
+        self.hooks = []  # the registered sub-language hooks
 
     # ---- helpers ------------------------------------------------------------------------
 
@@ -122,13 +129,30 @@ class Server:
     def wanted(self, frame):
         if frame.f_code.co_filename == _SELF:
             return False
+        category = self.category(frame)
+        if category == 0:
+            return True
         if self.all_files:
             return self.program_running
-        return os.path.basename(frame.f_code.co_filename) in self.files
+        return self.where(frame, category)[0] in self.files
 
-    def where(self, frame):
+    def where(self, frame, category=None):
+        category = self.category(frame) if category is None else category
+        if category == 1:
+            file, line = self.translate(frame)
+            return os.path.basename(file), line, frame.f_code.co_name
         name = os.path.basename(frame.f_code.co_filename)
-        return name, frame.f_lineno, frame.f_code.co_name
+        return name, frame.f_lineno if category != 0 else "impl", frame.f_code.co_name
+
+    def category(self, frame):
+        """The core's sub-language category of a frame of the calling thread."""
+        if not self.hooks:
+            return -1
+        return core.sub_language_get_frame_category(core.get_current_tstate_id(), frame)
+
+    def translate(self, frame):
+        hook = core.sub_language_get_active_hook(core.get_current_tstate_id())
+        return hook._TranslateFrame(frame, 0)
 
     def next_command(self):
         if self.commands:
@@ -315,6 +339,12 @@ def main(config_path):
         core.set_debug_thread_cb(server.debug_thread_cb)
     if "prelude" in config:
         exec(config["prelude"], {"core": core, "shared": shared, "threading": threading})
+    for spec in config.get("sub_languages", []):
+        module_name, _, name = spec.partition(":")
+        hook = getattr(__import__(module_name, fromlist=["_"]), name)
+        hook = hook() if isinstance(hook, type) else hook
+        core.register_sub_language_hook(hook)
+        server.hooks.append(hook)
     server.break_ids = [core.set_break(*args) for args in config.get("breaks", [])]
     sys.argv = [server.program]
     # As `python program.py` does: the program's folder comes first on the import path.
