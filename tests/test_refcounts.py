@@ -238,3 +238,19 @@ def test_exception_rounds_in_every_mode_leave_the_total_flat():
     totals = [int(x) for x in out.split()]
     assert len(totals) == 5
     assert totals[1:] == [totals[0]] * 4, totals
+
+
+@needs_debug
+def test_template_rounds_leave_the_total_flat():
+    # Each round registers the same two hook objects again (templang's, and one whose every
+    # method raises and so stays pending), renders templates in two threads with template
+    # breakpoints hit (conditions true, false and broken, an ignore count, a temporary one)
+    # while the callbacks step into, over and out of template lines, lets template lines
+    # raise, stops tracing and resets. The core keeps every hook it was given, so the first
+    # round (the first registration of the templang hook) may grow the total; registering
+    # the same objects again must not, nor anything else a round does.
+    out = subprocess.run([sys.executable, os.path.join(HERE, "refcount_templates.py"), "6"],
+                         capture_output=True, text=True, timeout=300, check=True).stdout
+    totals = [int(x) for x in out.split()]
+    assert len(totals) == 6
+    assert totals[1:] == [totals[0]] * 5, totals
