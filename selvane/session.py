@@ -438,10 +438,21 @@ class Session:
         self._set_resume("step_into")
 
     def next(self):
-        self._set_resume("step_over")
+        self._set_resume("step_into" if self._returning_to_key_frame() else "step_over")
 
     def step_out(self):
-        self._set_resume("step_out")
+        self._set_resume("step_into" if self._returning_to_key_frame() else "step_out")
+
+    def _returning_to_key_frame(self):
+        """Whether the program stands at the return of a Python function that a
+        sub-language's key frame called (a function a template line calls). Stepping over
+        or out of it means stopping at what comes next in the template; the core would take
+        either for running freely once the function is gone, since the template's lines are
+        no Python lines of the caller, so the next event is asked for instead: the next
+        template line (or the next function the same line calls)."""
+        stop = self.stop
+        return (stop is not None and stop.kind == "return" and self.frame is stop.frame
+                and self.frame_category(stop.frame.f_back, stop.thread) == KEY_FRAME)
 
     def cont(self):
         self._set_resume("continue_run")

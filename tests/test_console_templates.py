@@ -70,6 +70,7 @@ def test_break_in_a_template_step_through_it_and_out_of_it(tmp_path):
         assert "-> - {{ name }}: {{ money(qty * price) }}" in out
         assert dbg.do("p name, qty * price") == "('tea', 3.0)\n"
         assert dbg.do("p total") == "0\n"
+        assert "statements cannot run" in dbg.do("!name = 'x'")
         # The engine's own frames are hidden: the template line's caller is main().
         assert dbg.do("where").splitlines() == [
             "  prog.py:13 in <module>()", "    -> main()",
@@ -97,10 +98,21 @@ def test_break_in_a_template_step_through_it_and_out_of_it(tmp_path):
         assert stop_line(dbg.do("next")) == "> page.tpl:3"
         assert stop_line(dbg.do("next")).startswith("> page.tpl:4")
         assert dbg.do("p name, total") == "('cake', 3.0)\n"
-        assert "statements cannot run" in dbg.do("!name = 'x'")
-        # Out of the template: back in main(), after the render() call.
-        out = dbg.do("return")
-        assert stop_line(out) == "> prog.py:10 in main()"
+        # next and return from the return of a function the template called: on to the
+        # template's next line, not out of the template.
+        assert stop_line(dbg.do("step")) == "> prog.py:4 in money()"
+        assert stop_line(dbg.do("next")) == "> prog.py:5 in money()"
+        assert "<- money() returns '3.00'" in dbg.do("next")
+        assert stop_line(dbg.do("next")) == "> page.tpl:5"
+        assert stop_line(dbg.do("next")) == "> page.tpl:3"
+        out = dbg.do("next")
+        assert stop_line(out) == "> page.tpl:7"
+        assert "-> Total: {{ money(total) }}" in out
+        assert stop_line(dbg.do("step")) == "> prog.py:4 in money()"
+        assert stop_line(dbg.do("return")) == "> prog.py:5 in money()"
+        # The return of money() is the template's last line's last call: what comes next is
+        # the Python code after render().
+        assert stop_line(dbg.do("return")) == "> prog.py:10 in main()"
         assert dbg.do("p page") == repr(OUTPUT) + "\n"
         out, status = dbg.finish("continue")
         assert OUTPUT.replace("\n", "\n") in out.replace("\r", "")
@@ -124,6 +136,8 @@ def test_a_conditional_template_breakpoint_and_the_breakpoint_list(tmp_path):
         assert dbg.do("p name, total") == "('cake', 3.0)\n"
         listing = dbg.do("breakpoints")
         assert "page.tpl:5" in listing and "hit 2 times" in listing
+        # Out of the template from one of its lines: back in main(), after render().
+        assert stop_line(dbg.do("return")) == "> prog.py:10 in main()"
         out, status = dbg.finish("c")
         assert "Total: 6.00" in out and status == 0
     finally:
