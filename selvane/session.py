@@ -161,7 +161,10 @@ class Session:
         global _current
         _current = self
         for hook in _PROGRAM_HOOKS:  # registered by the program before this session began
-            self.register_sub_language_hook(hook)
+            try:
+                self.register_sub_language_hook(hook)
+            except SessionError as error:
+                frontend.message(f"sub-language hook not registered: {error}")
 
     # ---- the core --------------------------------------------------------------------------
 
