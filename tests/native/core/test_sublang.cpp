@@ -119,8 +119,14 @@ TEST_F(SubLanguageTest, TheImplementationCacheForgetsReleasedCode) {
     table->code_released(code.get());
     EXPECT_EQ(gSelf.sub_language.impl_cache.num_entries, 0u);
     EXPECT_EQ(__tracer_sub_language_in_impl(data_, f), 7);  // computed again
+    data_->stop_frame = Ref::borrow(f);
+    EXPECT_EQ(__tracer_sub_language_get_action(data_), -1);  // caches engine_step as no key
+    data_->stop_frame.reset();
+    EXPECT_EQ(gSelf.sub_language.key_cache.num_entries, 1u);
     table->code_released(nullptr);
     EXPECT_EQ(gSelf.sub_language.impl_cache.num_entries, 0u);
+    EXPECT_EQ(gSelf.sub_language.key_cache.num_entries, 0u);
+    EXPECT_EQ(gSelf.sub_language.enabled, 1);  // the hooks themselves stay
   });
   EXPECT_TRUE(ran);
   data_->sub_language_hook.reset();
