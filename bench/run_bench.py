@@ -24,6 +24,12 @@ Modes:
                   step_over, and the driver then calls the workload, so every event of the
                   workload is one where the core must find that the stop frame is an outer
                   frame and answer "no stop"
+  core-sublang-loaded  the core running freely with a sub-language hook registered and loaded
+                  whose marker the workload never calls: each call event asks whether its
+                  code is a marker
+  core-sublang-active  the same with the workload called under the hook's marker, so the
+                  sub-language is active: each event also asks whether its frame is a key
+                  frame or one of the implementation's
   exc-untraced    the exception workload (workload.exc_workload: raising and catching in the
                   same frame and one frame out), no trace function
   exc-null-c      the exception workload under the null C tracer: its floor
@@ -254,6 +260,64 @@ def mode_core_bp_unreached(n):
     return _run_core_with_breakpoint(n, wl.__file__, never_reached_line(wl.never_called))
 
 
+class _BenchHook:
+    """A loaded sub-language hook whose marker, key frame and files the workload never
+    touches: what every call event pays once a sub-language is registered."""
+
+    def __init__(self, marker, key):
+        self.marker, self.key = marker, key
+
+    def _GetMarkerFrames(self):
+        return [self.marker.__code__]
+
+    def _GetModulePaths(self):
+        return [(os.path.join(os.path.dirname(os.path.abspath(__file__)), "no-such-engine"), 1)]
+
+    def _GetSubLanguageFrames(self):
+        return [self.key.__code__]
+
+    def _StopHere(self, frame, event, action):
+        return False
+
+    def _TranslateFrame(self, frame, flag):
+        return ("<template>", 1)
+
+    def _Eval(self, condition, frame):
+        return False
+
+
+def _marker(n, work):
+    return timed(n, work)
+
+
+def _run_core_with_sub_language(n, active):
+    core = _core()
+    counter = _CallbackCounter()
+    _init_core(core, counter.line, counter.ret, counter.exc)
+    core.register_sub_language_hook(_BenchHook(_marker, _never_called_here))
+    core.continue_run()
+    core.start_trace()
+    try:
+        _check_core_installed()
+        # Under the marker every event of the workload asks whether it is a key frame or a
+        # frame of the implementation.
+        elapsed = _marker(n, None) if active else timed(n)
+    finally:
+        core.stop_trace()
+        core.reset()
+    if any(counter.calls.values()):
+        raise Failed(f"the core stopped under an idle sub-language: callbacks {counter.calls}")
+    return elapsed
+
+
+def mode_core_sublang_loaded(n):
+    return _run_core_with_sub_language(n, active=False)
+
+
+def mode_core_sublang_active(n):
+    return _run_core_with_sub_language(n, active=True)
+
+
 def _stepped_driver(n):
     elapsed = None  # the first stop in this frame: the line callback answers step_over
     elapsed = timed(n)  # stops here again, and steps over the call
@@ -389,6 +453,8 @@ MODES = {
     "core-bp-elsewhere": mode_core_bp_elsewhere,
     "core-bp-unreached": mode_core_bp_unreached,
     "core-step-over": mode_core_step_over,
+    "core-sublang-loaded": mode_core_sublang_loaded,
+    "core-sublang-active": mode_core_sublang_active,
     "exc-untraced": mode_exc_untraced,
     "exc-null-c": mode_exc_null,
     "exc-core-never": mode_exc_core_never,

@@ -59,6 +59,56 @@ Ref call_hook(PyObject* hook, const char* method, const char* format, Args... ar
   return result;
 }
 
+// ---- Which hook a code object belongs to -------------------------------------------------
+
+void reset_cache(CU_HashTable* cache) {
+  if (cache->buckets != nullptr) CU_DeleteHashTable(cache);
+  // Keys are code object addresses: a whole pointer on every platform we build for.
+  CU_InitHashTable(cache, sizeof(void*));
+}
+
+// The dictionaries changed: what the caches say may be wrong, and their hooks may be gone.
+void forget_roles() {
+  reset_cache(&state().marker_cache);
+  reset_cache(&state().key_cache);
+}
+
+void forget_code_in(CU_HashTable* cache, const PyObject* code) {
+  if (cache->num_entries == 0) return;
+  CU_HashEntry* entry = CU_FindHashEntry(cache, &code);
+  if (entry != nullptr) CU_DeleteHashEntry(entry);
+}
+
+// dict[code] through the cache (borrowed), or null. Only code objects that the pathname
+// table holds are cached: it keeps their addresses from being reused while the entry lives,
+// and tells us when it lets one go.
+PyObject* hook_of_code(CU_HashTable* cache, const Ref& dict, PyObject* code) {
+  if (!dict || code == nullptr) return nullptr;
+  CU_HashEntry* entry = CU_FindHashEntry(cache, &code);
+  if (entry != nullptr) {
+    auto* hook = static_cast<PyObject*>(CU_GetHashValue(entry));
+    return hook == Py_None ? nullptr : hook;
+  }
+  PyObject* hook = PyDict_GetItemWithError(dict.get(), code);
+  if (hook == nullptr) PyErr_Clear();
+  if (LookupCOPathname(&gSelf.co_pathname_table, code) == nullptr) {
+    PyErr_Clear();
+    return hook;
+  }
+  int is_new = 0;
+  entry = CU_CreateHashEntry(cache, &code, &is_new);
+  if (entry != nullptr) CU_SetHashValue(entry, hook != nullptr ? hook : Py_None);
+  return hook;
+}
+
+Ref marker_hook(PyObject* code) {
+  return Ref::borrow(hook_of_code(&state().marker_cache, state().marker_frames, code));
+}
+
+Ref key_hook(PyObject* code) {
+  return Ref::borrow(hook_of_code(&state().key_cache, state().key_frames, code));
+}
+
 // The non-empty list a hook method answered, or null. Results are meant to be lists; anything
 // else counts as a failure rather than being read as one.
 Ref call_for_list(PyObject* hook, const char* method) {
@@ -74,6 +124,7 @@ Ref call_for_list(PyObject* hook, const char* method) {
 // dict[item] = hook for every item of the list; false at the first failure.
 bool map_items_to_hook(const Ref& dict, const Ref& list, PyObject* hook) {
   if (!dict) return false;
+  forget_roles();
   // A snapshot: setting items can run the items' own hashing code, which may change the list.
   Ref items = Ref::steal(PyList_AsTuple(list.get()));
   if (!items) {
@@ -164,21 +215,22 @@ int value_for_path(PyObject* paths, const char* path) {
 
 void __tracer_init_sub_language_state(SubLanguageState* s) {
   release_state(s);
-  if (s->impl_cache.buckets != nullptr) CU_DeleteHashTable(&s->impl_cache);
-  // Keys are code object addresses: a whole pointer on every platform we build for.
-  CU_InitHashTable(&s->impl_cache, sizeof(void*));
+  reset_cache(&s->impl_cache);
+  reset_cache(&s->marker_cache);
+  reset_cache(&s->key_cache);
 }
 
 void __tracer_sub_language_forget_code(const PyObject* code) {
   SubLanguageState& s = state();
-  if (s.impl_cache.buckets == nullptr || s.impl_cache.num_entries == 0) return;
+  if (s.impl_cache.buckets == nullptr) return;  // before the state is first set up
   if (code == nullptr) {
-    CU_DeleteHashTable(&s.impl_cache);
-    CU_InitHashTable(&s.impl_cache, sizeof(void*));
+    reset_cache(&s.impl_cache);
+    forget_roles();
     return;
   }
-  CU_HashEntry* entry = CU_FindHashEntry(&s.impl_cache, &code);
-  if (entry != nullptr) CU_DeleteHashEntry(entry);
+  forget_code_in(&s.impl_cache, code);
+  forget_code_in(&s.marker_cache, code);
+  forget_code_in(&s.key_cache, code);
 }
 
 int __tracer_register_sub_language_hook(PyObject* hook) {
@@ -240,7 +292,7 @@ void __tracer_sub_language_dispatch_call(ThreadData* data, PyObject* frame) {
   // A marker called inside an active sub-language does not replace the outer one.
   if (data->sub_language_frame || !s.marker_frames) return;
   Ref code = code_of(frame);
-  Ref hook = lookup(s.marker_frames, code.get());
+  Ref hook = marker_hook(code.get());
   if (!hook) return;
   data->sub_language_frame = Ref::borrow(frame);
   data->sub_language_hook = std::move(hook);
@@ -258,13 +310,13 @@ int __tracer_sub_language_get_action(ThreadData* data) {
   if (data->step_out_frame && !data->step_out_frame.is_none()) return 2;
   if (data->stop_frame.is_none()) return 0;
   Ref code = code_of(data->stop_frame.get());
-  return lookup(state().key_frames, code.get()) ? 1 : -1;
+  return key_hook(code.get()) ? 1 : -1;
 }
 
 int __tracer_sub_language_stop_here(ThreadData* data, PyObject* frame, int event) {
   if (!gSelf.trace_started || !data->sub_language_hook) return 0;
   Ref code = code_of(frame);
-  Ref hook = lookup(state().key_frames, code.get());
+  Ref hook = key_hook(code.get());
   if (!hook) return 0;
   int action = __tracer_sub_language_get_action(data);
   Ref answer = call_hook(hook.get(), "_StopHere", "Oii", frame, event, action);
@@ -300,7 +352,7 @@ int __tracer_sub_language_get_frame_category(ThreadData* data, PyObject* frame) 
   if (data == nullptr || !data->sub_language_hook) return -1;
   Ref code = code_of(frame);
   if (!code) return -1;
-  if (lookup(state().key_frames, code.get())) return 1;
+  if (key_hook(code.get())) return 1;
   int in_impl = __tracer_sub_language_in_impl(data, frame);
   if (in_impl == -1 && PyErr_Occurred() != nullptr) {
     PyErr_Clear();

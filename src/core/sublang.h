@@ -31,6 +31,12 @@ struct SubLanguageState {
   Ref module_paths;         // owned dict: hook -> its list of (path prefix, int)
   Ref key_frames;           // owned dict: code object -> hook
   CU_HashTable impl_cache;  // code object address -> implementation test result
+  // Code object address -> its hook in marker_frames / key_frames, or None when it has none
+  // (borrowed from the dictionaries, emptied whenever they change). A code object hashes its
+  // whole contents, which costs a microsecond on current interpreters: far too much for every
+  // call and line event, so each code object is looked up in the dictionaries once.
+  CU_HashTable marker_cache;
+  CU_HashTable key_cache;
 };
 
 struct ThreadData;
