@@ -254,3 +254,16 @@ def test_template_rounds_leave_the_total_flat():
     totals = [int(x) for x in out.split()]
     assert len(totals) == 6
     assert totals[1:] == [totals[0]] * 5, totals
+
+
+@needs_debug
+def test_input_wait_and_copy_rounds_leave_the_total_flat():
+    # Each round: thousands of waits that answer at once or fail (pipes, a socket pair, end
+    # of file, bad files and socket lists, the debug messages written) and copies that fit,
+    # are truncated or are refused. After the first round every round must leave the total
+    # where it was.
+    out = subprocess.run([sys.executable, os.path.join(HERE, "refcount_input_wait.py"), "6"],
+                         capture_output=True, text=True, timeout=300, check=True).stdout
+    totals = [int(x) for x in out.split()]
+    assert len(totals) == 6
+    assert totals[1:] == [totals[0]] * 5, totals

@@ -81,3 +81,7 @@ PyObject* _tracer_clear_all_breaks(PyObject* self, PyObject* args);
 PyObject* _tracer_get_breaks(PyObject* self, PyObject* args);
 PyObject* _tracer_get_file_breaks(PyObject* self, PyObject* args);
 PyObject* get_changed_bps_lists(PyObject* self, PyObject* args);
+
+// io_methods.cpp: waiting for the program's input or the debug connection, buffer copy.
+PyObject* WrapWaitForInput(PyObject* self, PyObject* args);
+PyObject* WrapCopyIntoBuffer(PyObject* self, PyObject* args);

@@ -243,7 +243,14 @@ PyMethodDef gMethods[] = {
     METHOD("is_internal_frame", _tracer_is_internal_frame,
            "Returns id returned by thread.get_ident for given tstate_id"),
     METHOD("get_changed_bps_lists", get_changed_bps_lists, "Gets and clears the changed bp lists."),
-    // WaitForInput, CopyIntoBuffer
+    METHOD("WaitForInput", WrapWaitForInput,
+           "Wait until input is available on either the given file object or the socket file "
+           "descriptor.  Returns -1 if it was unable to wait for any reason (e.g. if arg 1 is "
+           "not a PyFileObject or an internal error occurs), 0 if input on the debug connection "
+           "is available, or the number of bytes that can safely be read  for the file object."),
+    METHOD("CopyIntoBuffer", WrapCopyIntoBuffer,
+           "Put data into a writable buffer at given offset,  If data is longer than the "
+           "remaining buffer space, it is truncated.  Returns # of bytes copied."),
     METHOD("PyFrame_LocalsToFast", wrap_PyFrame_LocalsToFast,
            "Wrapper around PyFrame_LocalsToFast internal api call."),
     // The trace function, the thread hooks and __import__ carry no docstring.
