@@ -75,8 +75,15 @@ void leave_debugger(DispatchEvent& event) {
   event.entered = false;
 }
 
+// The value a return event carries, or null when an exception left the frame. The trace
+// function's return event does not say which: the frame's latest event does. sys.monitoring
+// tells (PY_UNWIND comes without a value).
+PyObject* return_value(ThreadData* data, PyFrameObject* frame, PyObject* arg, bool monitoring) {
+  return monitoring ? arg : compat::return_value_of_event(data->last_exception_frame, frame, arg);
+}
+
 int dispatch_by_event(ThreadData* data, PyFrameObject* frame, int what, PyObject* arg,
-                      bool* propagate) {
+                      bool monitoring, bool* propagate) {
   PyObject* f = reinterpret_cast<PyObject*>(frame);
   int result = 0;
   switch (what) {
@@ -101,8 +108,7 @@ int dispatch_by_event(ThreadData* data, PyFrameObject* frame, int what, PyObject
       if (result != 0) do_dprintf(kDbgFlow, "TRACER LINE STOPPED TRACER\n");
       return result != 0 ? -1 : 0;
     case PyTrace_RETURN:
-      result = dispatch_return(
-          data, f, compat::return_value_of_event(data->last_exception_frame, frame, arg));
+      result = dispatch_return(data, f, return_value(data, frame, arg, monitoring));
       if (result != 0) do_dprintf(kDbgFlow, "TRACER RETURN STOPPED TRACER\n");
       return result != 0 ? -1 : 0;
     default:
@@ -123,7 +129,8 @@ void give_frame_f_trace(PyThreadState* ts, PyFrameObject* frame) {
 // Steps 8 to 11 of an event, once the thread may enter. Returns the trace function's result.
 // `data` is pinned by the caller: a reset while this thread waited or ran Python code has
 // renewed it in place, so it always describes the session in force now.
-int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int what, PyObject* arg) {
+int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int what, PyObject* arg,
+              bool monitoring) {
   bool stopped = false;
   bool propagate = false;
   if (!__ensure_tracer_status(ts, data)) {
@@ -134,7 +141,7 @@ int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int wha
       do_dprintf(kDbgFlow, "IDLE STOPPED TRACER\n");
       stopped = true;
     } else {
-      stopped = dispatch_by_event(data, frame, what, arg, &propagate) != 0;
+      stopped = dispatch_by_event(data, frame, what, arg, monitoring, &propagate) != 0;
       if (!stopped && !propagate && what == PyTrace_CALL) give_frame_f_trace(ts, frame);
     }
   }
@@ -165,7 +172,83 @@ void enter_debugger() {
   if (data->dispatch_event != nullptr) enter_for(data, *data->dispatch_event);
 }
 
-int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
+namespace {
+
+bool is_threading_bootstrap_code(PyCodeObject* code) {
+  const char* name = PyUnicode_AsUTF8(code->co_name);
+  const char* file = PyUnicode_AsUTF8(code->co_filename);
+  if (name == nullptr || file == nullptr) {
+    PyErr_Clear();
+    return false;
+  }
+  size_t length = std::strlen(file);
+  return (std::strcmp(name, "_bootstrap_inner") == 0 || std::strcmp(name, "_bootstrap") == 0) &&
+         length >= 12 && std::strcmp(file + length - 12, "threading.py") == 0;
+}
+
+PyCodeObject* code_of(PyFrameObject* frame) {  // new reference
+  return PyFrame_GetCode(frame);
+}
+
+bool is_bootstrap_frame(PyFrameObject* frame) {
+  PyCodeObject* code = code_of(frame);
+  bool found = is_threading_bootstrap_code(code);
+  Py_DECREF(code);
+  return found;
+}
+
+// Where a thread's own code starts, as the bootstrap calls it: run(), or a function of
+// another file than the bootstrap's (its helpers before and after run() share its file) that
+// is not the debugger's own (a server side may wrap the bootstrap).
+bool is_run_called_by_bootstrap(PyFrameObject* frame) {
+  PyFrameObject* caller = PyFrame_GetBack(frame);  // new reference or null
+  if (caller == nullptr) return false;
+  PyCodeObject* caller_code = code_of(caller);
+  Py_DECREF(caller);
+  PyCodeObject* code = code_of(frame);
+  bool found = false;
+  if (is_threading_bootstrap_code(caller_code)) {
+    const char* name = PyUnicode_AsUTF8(code->co_name);
+    if (name == nullptr) PyErr_Clear();
+    int same_file = PyUnicode_Compare(code->co_filename, caller_code->co_filename);
+    if (same_file == -1 && PyErr_Occurred() != nullptr) PyErr_Clear();
+    found = (name != nullptr && std::strcmp(name, "run") == 0) ||
+            (same_file != 0 && !is_internal_frame(reinterpret_cast<PyObject*>(frame)));
+  }
+  Py_DECREF(code);
+  Py_DECREF(caller_code);
+  return found;
+}
+
+// Under sys.monitoring, whether an event of the calling thread is the program's. The trace
+// function sees a thread that threading started from its run() on, where the thread start
+// hook fires; sys.monitoring also reports the thread machinery's frames before run() and
+// after it, which are passed over (see ThreadData::run_reached). No record is made for them.
+bool monitoring_event_wanted(PyThreadState* ts, PyFrameObject* frame, int what) {
+  ThreadData* data = find_thread_data(&gSelf.thread_table, ts);
+  if (data != nullptr && data->events_off) return false;  // switched off for this thread
+  if (data != nullptr && data->run_reached == 1) return true;
+  if (data == nullptr || data->run_reached == -1) {
+    // A thread inside run() already, or one that threading did not start, is the program's.
+    Ref outermost;
+    bool in_run = false;
+    for (Ref walk = Ref::borrow(reinterpret_cast<PyObject*>(frame)); walk;
+         walk = frame_back(walk.get())) {
+      in_run = in_run || is_run_called_by_bootstrap(reinterpret_cast<PyFrameObject*>(walk.get()));
+      outermost = walk;
+    }
+    bool started = in_run || !outermost ||
+                   !is_bootstrap_frame(reinterpret_cast<PyFrameObject*>(outermost.get()));
+    if (data != nullptr) data->run_reached = started ? 1 : 0;
+    if (started) return true;
+  }
+  if (what != PyTrace_CALL || !is_run_called_by_bootstrap(frame)) return false;
+  if (data != nullptr) data->run_reached = 1;
+  return true;
+}
+
+// One event from either source: which thread may enter, the mutex, and the handlers.
+int dispatch_event(PyFrameObject* frame, int what, PyObject* arg, bool monitoring) {
   ErrnoGuard errno_guard;
   if (gForkSeen) check_fork();
   if (gSelf.in_forked_child) return 0;
@@ -184,6 +267,8 @@ int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
     do_dprintf(kDbgFlow, "ignoring thread in c_dispatch\n");
     return 0;
   }
+  // (Before the thread policy: the thread is asked about once it runs the program's code.)
+  if (monitoring && !monitoring_event_wanted(ts, frame, what)) return 0;
   if (gSelf.debug_thread_cb && !__should_debug_thread(identity)) {
     do_dprintf(kDbgFlow, "ignore thread by policy\n");
     return 0;
@@ -193,7 +278,7 @@ int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
     PyErr_Clear();
     return 0;
   }
-  compat::note_event(data->last_exception_frame, frame, what);
+  if (!monitoring) compat::note_event(data->last_exception_frame, frame, what);
   // Whatever happens to the core while this event waits or runs callbacks (another thread
   // may reset or re-initialise it), the record stays valid until the event ends.
   PinnedThreadData pin(data);
@@ -201,10 +286,20 @@ int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
   data->dispatch_event = &event;
   // Another thread inside the debugger: wait for it here, before anything is decided.
   if (gSelf.selvane_mutex_owner != kNoMutexOwner || debug_output_on()) enter_for(data, event);
-  int result = run_event(ts, data, frame, what, arg);
+  int result = run_event(ts, data, frame, what, arg, monitoring);
   if (data->dispatch_event == &event) data->dispatch_event = event.outer;
   leave_debugger(event);
   return result;
+}
+
+}  // namespace
+
+int c_dispatch(PyObject*, PyFrameObject* frame, int what, PyObject* arg) {
+  return dispatch_event(frame, what, arg, false);
+}
+
+int dispatch_monitoring_event(PyFrameObject* frame, int what, PyObject* arg) {
+  return dispatch_event(frame, what, arg, true);
 }
 
 PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args) {
@@ -218,6 +313,14 @@ PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args) {
   if (!compat::is_plain_frame(frame)) {
     PyErr_SetString(PyExc_TypeError, "trace_dispatch needs a frame");
     return nullptr;
+  }
+  if (gSelf.event_source == kEventsFromMonitoring && gSelf.trace_started) {
+    // sys.monitoring delivers every event already; a thread start hook that installed this
+    // function as the thread's trace function would only double them.
+    PyThreadState* ts = compat::current_tstate();
+    if (gSelf.trace_dispatch.is(compat::tstate_traceobj(ts))) PyEval_SetTrace(nullptr, nullptr);
+    if (PyErr_Occurred() != nullptr) return nullptr;
+    Py_RETURN_NONE;
   }
   const char* name = _pystring_to_c_string(event);
   int what = -1;

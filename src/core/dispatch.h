@@ -8,6 +8,9 @@
 #include "threads/threadops.h"
 
 int c_dispatch(PyObject* obj, PyFrameObject* frame, int what, PyObject* arg);
+// The same for an event that sys.monitoring delivered, already mapped to a trace event code;
+// for a return event `arg` is the value returned, or null when an exception left the frame.
+int dispatch_monitoring_event(PyFrameObject* frame, int what, PyObject* arg);
 PyObject* _tracer_trace_dispatch(PyObject* self, PyObject* args);
 
 // Per-event handlers, for the calling thread's record: 0 to go on, -1 to stop tracing the

@@ -7,6 +7,7 @@
 
 #include "core/dispatch.h"
 #include "core/imports.h"
+#include "core/monitoring.h"
 #include "core/tracercore.h"
 #include "support/dbgcommon.h"
 #include "support/dprintf.h"
@@ -66,7 +67,17 @@ void name_thread(ThreadData* data, PyObject* frame) {
 
 // Gives another thread our C trace function where the interpreter lets us; returns whether
 // it did. On 3.13 a thread installs itself at its next event instead.
+bool monitoring_in_force() {
+  return gSelf.event_source == kEventsFromMonitoring;
+}
+
 bool set_thread_trace(PyThreadState* ts, ThreadData* data, bool on) {
+  if (monitoring_in_force()) {
+    // Events reach every thread; the thread's flag says whether it takes them.
+    data->events_off = on ? 0 : 1;
+    data->global_trace_set = on ? 1 : 0;
+    return true;
+  }
   if (static_cast<bool>(data->global_trace_set) == on) return true;
   PinnedThreadData pin(data);  // dropping the old trace object can run any code
   bool done = on ? compat::set_trace_for_thread(ts, c_dispatch, gSelf.trace_dispatch.get())
@@ -108,7 +119,9 @@ void install_tracer_into_frames(PyThreadState* tstate) {
   for (Ref frame = compat::tstate_frame(tstate); frame; frame = frame_back(frame.get())) {
     do_dprintf(kDbgFlow, "\tinserting into thread state %p; frame = %p\n", tstate, frame.get());
     if (!compat::is_plain_frame(frame.get())) continue;
-    set_f_trace(frame.get(), gSelf.trace_dispatch.get());
+    // f_trace belongs to the trace function: under sys.monitoring a Python tracer of another
+    // tool (a coverage tool) would find ours there and call it.
+    if (!monitoring_in_force()) set_f_trace(frame.get(), gSelf.trace_dispatch.get());
     data->bot_frame = frame;
     // Only the innermost frame decides the thread's name.
     if (!data->thread_name) name_thread(data, frame.get());
@@ -136,7 +149,9 @@ void install_tracer(PyInterpreterState* interp) {
   }
   // Threads that already run are traced from now on, not only once they happen to call
   // into something that installs us: all at once where the interpreter can, else one by one.
-  bool all = compat::set_trace_all_threads(c_dispatch, gSelf.trace_dispatch.get());
+  // (sys.monitoring reaches every thread by itself.)
+  bool all = !monitoring_in_force() &&
+             compat::set_trace_all_threads(c_dispatch, gSelf.trace_dispatch.get());
   for (PyThreadState* ts : states) {
     if (!thread_state_alive(interp, ts)) continue;
     ThreadData* data = find_thread_data(&gSelf.thread_table, ts);
@@ -154,6 +169,7 @@ namespace {
 // every thread's at once: done when every thread that has one has ours, so that no foreign
 // tracer is touched.
 void clear_remaining_trace_functions(PyInterpreterState* interp) {
+  if (monitoring_in_force()) return;
   bool ours_left = false;
   for (PyThreadState* ts : thread_states(interp)) {
     Py_tracefunc func = compat::tstate_tracefunc(ts);
@@ -175,7 +191,7 @@ void remove_tracer(PyInterpreterState* interp) {
     ThreadData* data = find_thread_data(&gSelf.thread_table, ts);
     // Other threads drop our C trace function now where the interpreter lets us.
     if (data != nullptr && ts != compat::current_tstate() &&
-        compat::tstate_tracefunc(ts) == c_dispatch) {
+        (monitoring_in_force() || compat::tstate_tracefunc(ts) == c_dispatch)) {
       set_thread_trace(ts, data, false);
     }
   }
@@ -205,6 +221,11 @@ void install_start_thread_hooks(int flag) {
 int __tracer_start_trace() {
   do_dprintf(kDbgFlow, "START TRACING\n");
   if (gSelf.trace_started) return 1;
+  gSelf.event_source = gSelf.requested_event_source;
+  if (monitoring_in_force() && monitoring_start() != 0) {
+    gSelf.event_source = kEventsFromTrace;
+    return 0;
+  }
   gSelf.instruction_count = 0;
   gSelf.trace_started = 1;
   initial_module_scan();
@@ -219,6 +240,7 @@ void __tracer_stop_trace() {
   gSelf.trace_started = 0;
   remove_tracer(PyInterpreterState_Get());
   set_global_trace_function(0);
+  if (monitoring_in_force()) monitoring_stop();
   install_start_thread_hooks(0);
 }
 

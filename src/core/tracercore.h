@@ -29,8 +29,18 @@ enum ExceptionMode : int {
 // selvane_mutex_owner when nobody holds the mutex.
 constexpr unsigned long kNoMutexOwner = static_cast<unsigned long>(-1);
 
+// Where events come from: the interpreter's trace function, or sys.monitoring (3.12+).
+enum EventSource : int32_t {
+  kEventsFromTrace = 0,
+  kEventsFromMonitoring = 1,
+};
+
 struct TracerState {
   int trace_started = 0;
+  // Chosen at init (SELVANE_EVENT_SOURCE); start_trace puts it in force, and the source in
+  // force is the one stop_trace takes down.
+  EventSource requested_event_source = kEventsFromTrace;
+  EventSource event_source = kEventsFromTrace;
   float idle_period = 0;  // seconds; 0 or less turns the idle callback off
   int in_idle = 0;
   int exception_mode = kExcNeverStop;

@@ -95,6 +95,14 @@ PyObject* _tracer_step_out(PyObject*, PyObject*) {
 PyObject* _tracer_bootstrap_new_thread(PyObject* self, PyObject* args) {
   if (!initialised("bootstrap_new_thread")) return nullptr;
   PyThreadState* ts = compat::current_tstate();
+  if (gSelf.event_source == kEventsFromMonitoring) {
+    // sys.monitoring delivered this thread's events from its first frame on (this very
+    // call's too): its record and policy answer are this thread's own, and the trace function
+    // that the thread start hook set only served to bring us here.
+    PyEval_SetTrace(nullptr, nullptr);
+    if (PyErr_Occurred() != nullptr) return nullptr;
+    Py_RETURN_NONE;
+  }
   // The interpreter reuses thread-state memory: a record under this pointer belongs to a
   // thread that has ended.
   __tracer_forget_thread(ts);
@@ -109,7 +117,7 @@ PyObject* _tracer_thread_exiting(PyObject*, PyObject*) {
   PyThreadState* ts = compat::current_tstate();
   ThreadData* data = find_thread_data(&gSelf.thread_table, ts);
   // The thread's last returns must not bring its record back: it stops being traced here.
-  if (data != nullptr && data->global_trace_set) {
+  if (data != nullptr && data->global_trace_set && gSelf.event_source == kEventsFromTrace) {
     PyEval_SetTrace(nullptr, nullptr);
     if (PyErr_Occurred() != nullptr) return nullptr;
   }

@@ -8,6 +8,7 @@
 #include <pthread.h>
 
 #include "core/dispatch.h"
+#include "core/monitoring.h"
 #include "core/tracercore.h"
 #include "exc/handlers.h"
 #include "module/methods.h"
@@ -79,10 +80,14 @@ PyObject* _tracer_init(PyObject*, PyObject* args) {
                         &dprintf_file, &internal_modules_map)) {
     return nullptr;
   }
+  // Where events come from is an environment setting, refused before anything changes.
+  int event_source = kEventsFromTrace;
   if (!check_init_arguments(cbs, import_cb, default_import, internal_modules_map) ||
-      !default_import_is_not_our_hook(default_import)) {
+      !default_import_is_not_our_hook(default_import) ||
+      read_event_source_setting(&event_source) != 0) {
     return nullptr;
   }
+  gSelf.requested_event_source = static_cast<EventSource>(event_source);
   if (!__tracer_init(gModuleSelf, idle_period, exception_mode, cbs[0], cbs[1], cbs[2], cbs[3],
                      cbs[4], cbs[5], import_cb, default_import, dprintf_file,
                      internal_modules_map)) {

@@ -124,6 +124,8 @@ void renew_thread_data(ThreadData* data) {
                 std::move(data->pending_exception)};
   data->tracer_in_frames = 0;
   data->global_trace_set = 0;
+  data->events_off = 0;
+  data->run_reached = -1;
   data->thread_name = Ref::none();
   data->bot_frame = Ref::none();
   data->step_out_frame = Ref::none();

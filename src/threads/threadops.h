@@ -22,8 +22,16 @@
 #include "support/ref.h"
 
 struct ThreadData {
-  int32_t tracer_in_frames = 0;   // 1 once the tracer was put into the thread's frames
-  int32_t global_trace_set = 0;   // 1 while the thread's C trace function is ours
+  int32_t tracer_in_frames = 0;  // 1 once the tracer was put into the thread's frames
+  int32_t global_trace_set = 0;  // 1 while the thread's C trace function is ours
+  // With sys.monitoring, events reach every thread: 1 while this thread's tracing is
+  // switched off (as a failed callback does), the counterpart of removing its trace function.
+  int32_t events_off = 0;
+  // With sys.monitoring: whether a thread that threading started has reached its run()
+  // (-1 not known yet, 0 not yet, 1 yes). The trace function sees such a thread from run()
+  // on, where the thread start hook fires; sys.monitoring reports the thread machinery's own
+  // frames before it, which are passed over.
+  int32_t run_reached = -1;
   PyThreadState* tstate;          // the key; borrowed, never dereferenced after the thread ends
   unsigned long thread_id;        // the thread's identity, refreshed on every lookup
   Ref thread_name;                // owned: name of the thread's main function, or None

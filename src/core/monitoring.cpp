@@ -1,0 +1,266 @@
+// monitoring.cpp: sys.monitoring as the source of events (see monitoring.h).
+//
+// The callbacks are builtin functions of our own (vectorcall, no Python frame of their own):
+// the frame of an event is the interpreter's current frame while the callback runs. They map
+// the event and hand it to the same dispatcher as the trace function. A callback that returns
+// an error makes the interpreter raise it at the event's place in the program, which is how
+// an exception injected with raise_exception reaches the program here too.
+//
+// Whatever a callback returns, it is never DISABLE from an exception event: up to 3.14 that
+// raises in the program and unregisters the callback for the whole process.
+#include "core/monitoring.h"
+
+#include <cstdlib>
+#include <cstring>
+
+#include "core/dispatch.h"
+#include "core/tracercore.h"
+#include "support/dbgcommon.h"
+#include "support/dprintf.h"
+#include "support/pycompat.h"
+#include "support/ref.h"
+
+namespace {
+
+constexpr const char* kToolName = "selvane";
+
+// ---- Mapping the events ---------------------------------------------------------------------
+
+// Hands one mapped event to the dispatcher; None, or null with the error to raise.
+PyObject* deliver(int what, PyObject* arg) {
+  PyFrameObject* frame = PyEval_GetFrame();  // borrowed: the event's frame
+  if (frame == nullptr) Py_RETURN_NONE;
+  if (dispatch_monitoring_event(frame, what, arg) != 0 && PyErr_Occurred() != nullptr) {
+    return nullptr;
+  }
+  Py_RETURN_NONE;
+}
+
+PyObject* on_call(PyObject*, PyObject* const*, Py_ssize_t) {
+  return deliver(PyTrace_CALL, nullptr);
+}
+
+PyObject* on_return(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
+  return deliver(PyTrace_RETURN, nargs > 2 ? args[2] : Py_None);
+}
+
+PyObject* on_unwind(PyObject*, PyObject* const*, Py_ssize_t) {
+  return deliver(PyTrace_RETURN, nullptr);  // left by an exception: no value
+}
+
+PyObject* on_line(PyObject*, PyObject* const*, Py_ssize_t) {
+  return deliver(PyTrace_LINE, nullptr);
+}
+
+int line_of(PyObject* code, PyObject* offset) {
+  long at = PyLong_AsLong(offset);
+  if (at == -1 && PyErr_Occurred() != nullptr) {
+    PyErr_Clear();
+    return -1;
+  }
+  return PyCode_Addr2Line(reinterpret_cast<PyCodeObject*>(code), static_cast<int>(at));
+}
+
+// A jump back to an earlier instruction of the same line starts the line again: the trace
+// function reports it as a line event, LINE does not.
+PyObject* on_jump(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
+  if (nargs < 3 || !PyCode_Check(args[0])) Py_RETURN_NONE;
+  int cmp = PyObject_RichCompareBool(args[2], args[1], Py_LT);
+  if (cmp <= 0) {
+    if (cmp < 0) PyErr_Clear();
+    Py_RETURN_NONE;
+  }
+  int from = line_of(args[0], args[1]);
+  if (from < 0 || from != line_of(args[0], args[2])) Py_RETURN_NONE;
+  return deliver(PyTrace_LINE, nullptr);
+}
+
+// The trace function's exception argument: (type, value, traceback).
+PyObject* deliver_exception(PyObject* exc) {
+  PyObject* tb = PyException_GetTraceback(exc);  // new reference or null
+  Ref traceback = tb != nullptr ? Ref::steal(tb) : Ref::none();
+  Ref arg =
+      Ref::steal(PyTuple_Pack(3, reinterpret_cast<PyObject*>(Py_TYPE(exc)), exc, traceback.get()));
+  if (!arg) {
+    PyErr_Clear();  // without memory for the tuple this event goes unseen
+    Py_RETURN_NONE;
+  }
+  return deliver(PyTrace_EXCEPTION, arg.get());
+}
+
+PyObject* on_raise(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
+  if (nargs < 3 || !PyExceptionInstance_Check(args[2])) Py_RETURN_NONE;
+  return deliver_exception(args[2]);
+}
+
+// A generator or coroutine that returns inside `yield from`/`await` ends its callee with a
+// StopIteration that is never raised as an object: the event carries the instance on some
+// versions and the value on others. The trace function reports a StopIteration.
+PyObject* on_stop_iteration(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
+  if (nargs < 3) Py_RETURN_NONE;
+  if (PyObject_TypeCheck(args[2], reinterpret_cast<PyTypeObject*>(PyExc_StopIteration))) {
+    return deliver_exception(args[2]);
+  }
+  Ref exc = Ref::steal(PyObject_CallOneArg(PyExc_StopIteration, args[2]));
+  if (!exc) {
+    PyErr_Clear();
+    Py_RETURN_NONE;
+  }
+  return deliver_exception(exc.get());
+}
+
+// ---- The tool ---------------------------------------------------------------------------------
+
+struct EventCallback {
+  const char* event;  // name in sys.monitoring.events
+  PyMethodDef method;
+};
+
+#define CALLBACK(event, fn)                                                              \
+  {                                                                                      \
+    event, {                                                                             \
+      "selvane_" event, reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(fn)), \
+          METH_FASTCALL, nullptr                                                         \
+    }                                                                                    \
+  }
+
+EventCallback gCallbacks[] = {
+    CALLBACK("PY_START", on_call),   CALLBACK("PY_RESUME", on_call),
+    CALLBACK("PY_THROW", on_call),   CALLBACK("PY_RETURN", on_return),
+    CALLBACK("PY_YIELD", on_return), CALLBACK("PY_UNWIND", on_unwind),
+    CALLBACK("LINE", on_line),       CALLBACK("JUMP", on_jump),
+    CALLBACK("RAISE", on_raise),     CALLBACK("STOP_ITERATION", on_stop_iteration),
+};
+
+#undef CALLBACK
+
+constexpr size_t kCallbackCount = sizeof(gCallbacks) / sizeof(gCallbacks[0]);
+
+struct MonitoringTool {
+  Ref monitoring;                  // sys.monitoring while the tool is in use
+  Ref tool_id;                     // int: sys.monitoring.DEBUGGER_ID
+  Ref event_bits[kCallbackCount];  // int per callback, read from sys.monitoring.events
+  bool in_use = false;
+};
+
+MonitoringTool gTool;
+
+Ref monitoring_module() {
+  Ref sys = Ref::steal(PyImport_ImportModule("sys"));
+  if (!sys) return Ref();
+  Ref monitoring = Ref::steal(PyObject_GetAttrString(sys.get(), "monitoring"));
+  if (!monitoring) {
+    PyErr_Clear();
+    PyErr_SetString(PyExc_RuntimeError,
+                    "sys.monitoring is not available in this interpreter (Python 3.12 or later "
+                    "has it)");
+  }
+  return monitoring;
+}
+
+// Refuses an id that another tool holds, naming it. 0 when the id is free.
+int check_tool_id_free(PyObject* monitoring, PyObject* tool_id) {
+  Ref holder = Ref::steal(PyObject_CallMethod(monitoring, "get_tool", "O", tool_id));
+  if (!holder) return -1;
+  if (holder.is_none()) return 0;
+  Ref name = Ref::steal(PyObject_Repr(holder.get()));
+  PyErr_Format(PyExc_RuntimeError,
+               "sys.monitoring tool id %S (the debugger's) is already in use by %s: another "
+               "debugger holds it; set SELVANE_EVENT_SOURCE=settrace to debug with the trace "
+               "function instead",
+               tool_id, name ? PyUnicode_AsUTF8(name.get()) : "another tool");
+  return -1;
+}
+
+bool read_event_bits(PyObject* monitoring) {
+  Ref events = Ref::steal(PyObject_GetAttrString(monitoring, "events"));
+  if (!events) return false;
+  for (size_t i = 0; i < kCallbackCount; ++i) {
+    gTool.event_bits[i] = Ref::steal(PyObject_GetAttrString(events.get(), gCallbacks[i].event));
+    if (!gTool.event_bits[i]) return false;
+  }
+  return true;
+}
+
+// Registers every callback (or, with `on` false, unregisters them) and sums the events.
+bool register_callbacks(bool on, long* mask) {
+  *mask = 0;
+  for (size_t i = 0; i < kCallbackCount; ++i) {
+    Ref callback = on ? Ref::steal(PyCFunction_New(&gCallbacks[i].method, nullptr)) : Ref::none();
+    if (!callback) return false;
+    Ref previous = Ref::steal(PyObject_CallMethod(gTool.monitoring.get(), "register_callback",
+                                                  "OOO", gTool.tool_id.get(),
+                                                  gTool.event_bits[i].get(), callback.get()));
+    if (!previous) return false;
+    *mask |= PyLong_AsLong(gTool.event_bits[i].get());
+  }
+  return PyErr_Occurred() == nullptr;
+}
+
+bool set_events(long mask) {
+  Ref done = Ref::steal(
+      PyObject_CallMethod(gTool.monitoring.get(), "set_events", "Ol", gTool.tool_id.get(), mask));
+  return static_cast<bool>(done);
+}
+
+void log_and_clear() {
+  if (PyErr_Occurred() == nullptr) return;
+  DLOGEXCEPTION();
+  PyErr_Clear();
+}
+
+}  // namespace
+
+int read_event_source_setting(int* source) {
+  const char* value = std::getenv("SELVANE_EVENT_SOURCE");
+  if (value == nullptr || value[0] == '\0' || std::strcmp(value, "settrace") == 0) {
+    *source = kEventsFromTrace;
+    return 0;
+  }
+  if (std::strcmp(value, "monitoring") != 0) {
+    PyErr_Format(PyExc_ValueError,
+                 "SELVANE_EVENT_SOURCE must be 'settrace' or 'monitoring', not '%s'", value);
+    return -1;
+  }
+  if (!monitoring_module()) return -1;
+  *source = kEventsFromMonitoring;
+  return 0;
+}
+
+int monitoring_start() {
+  if (gTool.in_use) return 0;
+  Ref monitoring = monitoring_module();
+  if (!monitoring) return -1;
+  Ref tool_id = Ref::steal(PyObject_GetAttrString(monitoring.get(), "DEBUGGER_ID"));
+  if (!tool_id || check_tool_id_free(monitoring.get(), tool_id.get()) != 0) return -1;
+  gTool.monitoring = monitoring;
+  gTool.tool_id = tool_id;
+  if (!read_event_bits(monitoring.get())) return -1;
+  Ref used = Ref::steal(
+      PyObject_CallMethod(monitoring.get(), "use_tool_id", "Os", tool_id.get(), kToolName));
+  if (!used) return -1;
+  gTool.in_use = true;
+  long mask = 0;
+  if (!register_callbacks(true, &mask) || !set_events(mask)) {
+    compat::PendingError failure;
+    failure.fetch();
+    monitoring_stop();
+    failure.restore();
+    return -1;
+  }
+  do_dprintf(kDbgFlow, "sys.monitoring: events 0x%lx as tool %s\n", mask, kToolName);
+  return 0;
+}
+
+void monitoring_stop() {
+  if (!gTool.in_use) return;
+  gTool.in_use = false;
+  // Up to 3.13 freeing the id leaves its events and callbacks in force: all go first.
+  if (!set_events(0)) log_and_clear();
+  long mask = 0;
+  if (!register_callbacks(false, &mask)) log_and_clear();
+  Ref freed = Ref::steal(
+      PyObject_CallMethod(gTool.monitoring.get(), "free_tool_id", "O", gTool.tool_id.get()));
+  if (!freed) log_and_clear();
+  do_dprintf(kDbgFlow, "sys.monitoring: tool %s stopped\n", kToolName);
+}

@@ -1,0 +1,36 @@
+// monitoring.h: the second event source, sys.monitoring (CPython 3.12 and later).
+//
+// The trace function makes the interpreter call us on every event of every traced frame.
+// With sys.monitoring the core registers C callbacks as the debugger tool and receives the
+// same events, mapped to the trace function's call, line, return and exception events so that
+// every decision downstream (stepping, breakpoints, exceptions, threads, sub-languages) is
+// the same whichever source delivered the event:
+//
+//   call       <- PY_START, PY_RESUME, PY_THROW
+//   return     <- PY_RETURN and PY_YIELD with their value; PY_UNWIND, the frame left by an
+//                 exception (no value)
+//   exception  <- RAISE (delivered in every frame the exception passes through, as the trace
+//                 function's exception event is) and STOP_ITERATION
+//   line       <- LINE, and a JUMP backwards within one line (the trace function reports the
+//                 line again for each turn of a loop written on one line)
+//
+// RERAISE, EXCEPTION_HANDLED and C_RAISE have no counterpart and are not asked for. PY_START
+// stays on wherever lines are wanted: from 3.13 on, a code object whose body is on its
+// header line reports no LINE for that line unless PY_START is enabled for it.
+//
+// The event bit values moved in 3.14: they are read from sys.monitoring.events at start.
+#pragma once
+
+#include <Python.h>
+
+// SELVANE_EVENT_SOURCE as init reads it: "settrace" or "monitoring" (unset or empty: the
+// default). 0 with the choice stored in *source, or -1 with ValueError (an unknown value) or
+// RuntimeError (monitoring asked for where the interpreter has no sys.monitoring).
+int read_event_source_setting(int* source);
+
+// Takes the debugger tool id and registers the callbacks with their events. 0, or -1 with
+// RuntimeError naming the tool that holds the id (nothing changed then).
+int monitoring_start();
+// Switches every event of the tool off, unregisters the callbacks and frees the id. Errors
+// are logged and dropped: stopping must always succeed.
+void monitoring_stop();
