@@ -13,16 +13,32 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "bp/bpops.h"
 #include "core/dispatch.h"
 #include "core/tracercore.h"
+#include "exc/exceptops.h"
 #include "support/dbgcommon.h"
 #include "support/dprintf.h"
 #include "support/pycompat.h"
+#include "threads/threadops.h"
 #include "support/ref.h"
 
 namespace {
 
 constexpr const char* kToolName = "selvane";
+
+constexpr size_t kCallbackCount = 10;  // the events of gCallbacks below
+
+struct MonitoringTool {
+  Ref monitoring;                  // sys.monitoring while the tool is in use
+  Ref tool_id;                     // int: sys.monitoring.DEBUGGER_ID
+  Ref disable;                     // sys.monitoring.DISABLE
+  Ref event_bits[kCallbackCount];  // int per callback, read from sys.monitoring.events
+  bool in_use = false;
+  bool quiet = false;  // some place answered DISABLE since the last restart
+};
+
+MonitoringTool gTool;
 
 // ---- Mapping the events ---------------------------------------------------------------------
 
@@ -36,20 +52,129 @@ PyObject* deliver(int what, PyObject* arg) {
   Py_RETURN_NONE;
 }
 
-PyObject* on_call(PyObject*, PyObject* const*, Py_ssize_t) {
+// PY_THROW: a call event whose place must never answer DISABLE (see the head of the file).
+PyObject* on_throw(PyObject*, PyObject* const*, Py_ssize_t) {
   return deliver(PyTrace_CALL, nullptr);
-}
-
-PyObject* on_return(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
-  return deliver(PyTrace_RETURN, nargs > 2 ? args[2] : Py_None);
 }
 
 PyObject* on_unwind(PyObject*, PyObject* const*, Py_ssize_t) {
   return deliver(PyTrace_RETURN, nullptr);  // left by an exception: no value
 }
 
-PyObject* on_line(PyObject*, PyObject* const*, Py_ssize_t) {
-  return deliver(PyTrace_LINE, nullptr);
+// ---- Quiet places -----------------------------------------------------------------------------
+
+bool any_thread_may_stop_at_a_line() {
+  if (gSelf.pending_exception_count != 0) return true;
+  CU_HashSearch search;
+  for (CU_HashEntry* entry = CU_FirstHashEntry(&gSelf.thread_table, &search); entry != nullptr;
+       entry = CU_NextHashEntry(&search)) {
+    auto* data = static_cast<ThreadData*>(CU_GetHashValue(entry));
+    if (data == nullptr) continue;
+    if (data->stop_frame || (data->step_out_frame && !data->step_out_frame.is_none())) return true;
+  }
+  return false;
+}
+
+// Running freely everywhere: no thread steps, waits to stop or has an exception to raise, and
+// no sub-language decides at its frames. (The idle callback runs at most once a second, on
+// the events that still come; a server side that wants a thread to stop gives it a command,
+// which brings every place back.)
+bool all_run_freely() {
+  return !gSelf.sub_language.enabled && gSelf.trace_started && !any_thread_may_stop_at_a_line();
+}
+
+bool has_breakpoint_line(long line) {
+  return __tracer_bps_at_line(&gSelf.bp_ops_data, static_cast<int32_t>(line)) != nullptr;
+}
+
+bool line_may_go_quiet(long line) {
+  return !has_breakpoint_line(line) && all_run_freely();
+}
+
+PyCodeObject* function_code(PyFrameObject* frame) {  // new reference, or null
+  PyCodeObject* code = PyFrame_GetCode(frame);
+  if ((code->co_flags & CO_OPTIMIZED) != 0) return code;
+  Py_DECREF(code);  // module and class bodies: their calls register modules, and run once
+  return nullptr;
+}
+
+bool is_bot_frame_code_of_a_thread(PyCodeObject* code) {
+  CU_HashSearch search;
+  for (CU_HashEntry* entry = CU_FirstHashEntry(&gSelf.thread_table, &search); entry != nullptr;
+       entry = CU_NextHashEntry(&search)) {
+    auto* data = static_cast<ThreadData*>(CU_GetHashValue(entry));
+    if (data == nullptr || !data->bot_frame || data->bot_frame.is_none()) continue;
+    PyCodeObject* bot_code =
+        PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(data->bot_frame.get()));
+    Py_DECREF(bot_code);
+    if (bot_code == code) return true;
+  }
+  return false;
+}
+
+// A function's call events tell the running core nothing once its thread has a bottom frame.
+// (From 3.13 on a function written on its header line loses its first LINE where PY_START is
+// quiet: not while that line has a breakpoint.)
+bool call_may_go_quiet(PyFrameObject* frame) {
+  if (!all_run_freely()) return false;
+  PyCodeObject* code = function_code(frame);
+  if (code == nullptr) return false;
+  bool quiet = !has_breakpoint_line(code->co_firstlineno);
+  Py_DECREF(code);
+  if (!quiet) return false;
+  ThreadData* data = find_thread_data(&gSelf.thread_table, PyThreadState_Get());
+  return data != nullptr && data->bot_frame && !data->bot_frame.is_none();
+}
+
+// A function's returns tell the running core nothing unless it is some thread's bottom frame
+// (autoquit, the thread policy) or holds an exception record to forget.
+bool return_may_go_quiet(PyFrameObject* frame) {
+  if (!all_run_freely()) return false;
+  PyCodeObject* code = function_code(frame);
+  if (code == nullptr) return false;
+  bool quiet = !is_bot_frame_code_of_a_thread(code);
+  Py_DECREF(code);
+  return quiet && (!gSelf.exc_data.frame_exc_info ||
+                   find_frame_exc_info(&gSelf.exc_data.frame_exc_info,
+                                       reinterpret_cast<PyObject*>(frame)) == nullptr);
+}
+
+// DISABLE for a place that answered None and may go quiet.
+PyObject* quiet_answer(PyObject* answer, bool (*may_go_quiet)(PyFrameObject*)) {
+  if (answer != Py_None || !gTool.disable) return answer;
+  PyFrameObject* frame = PyEval_GetFrame();
+  if (frame == nullptr || !may_go_quiet(frame)) return answer;
+  Py_DECREF(answer);
+  gTool.quiet = true;
+  return gTool.disable.new_ref();
+}
+
+PyObject* on_call(PyObject*, PyObject* const*, Py_ssize_t) {
+  return quiet_answer(deliver(PyTrace_CALL, nullptr), call_may_go_quiet);
+}
+
+PyObject* on_return(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
+  return quiet_answer(deliver(PyTrace_RETURN, nargs > 2 ? args[2] : Py_None), return_may_go_quiet);
+}
+
+// The answer to a line event that went through the dispatcher: DISABLE where the place may go
+// quiet, else what the dispatcher answered.
+PyObject* quiet_if_possible(PyObject* answer, long line) {
+  if (answer != Py_None || !gTool.disable || !line_may_go_quiet(line)) return answer;
+  Py_DECREF(answer);
+  gTool.quiet = true;
+  return gTool.disable.new_ref();
+}
+
+PyObject* on_line(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
+  PyObject* answer = deliver(PyTrace_LINE, nullptr);
+  if (answer == nullptr || nargs < 2) return answer;
+  long line = PyLong_AsLong(args[1]);
+  if (line == -1 && PyErr_Occurred() != nullptr) {
+    PyErr_Clear();
+    return answer;
+  }
+  return quiet_if_possible(answer, line);
 }
 
 int line_of(PyObject* code, PyObject* offset) {
@@ -66,13 +191,15 @@ int line_of(PyObject* code, PyObject* offset) {
 PyObject* on_jump(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
   if (nargs < 3 || !PyCode_Check(args[0])) Py_RETURN_NONE;
   int cmp = PyObject_RichCompareBool(args[2], args[1], Py_LT);
-  if (cmp <= 0) {
-    if (cmp < 0) PyErr_Clear();
-    Py_RETURN_NONE;
+  if (cmp < 0) PyErr_Clear();
+  int from = cmp > 0 ? line_of(args[0], args[1]) : -1;
+  if (from < 0 || from != line_of(args[0], args[2])) {
+    // This jump is never a line's new start: its place has nothing to tell, ever.
+    if (!gTool.disable) Py_RETURN_NONE;
+    gTool.quiet = true;
+    return gTool.disable.new_ref();
   }
-  int from = line_of(args[0], args[1]);
-  if (from < 0 || from != line_of(args[0], args[2])) Py_RETURN_NONE;
-  return deliver(PyTrace_LINE, nullptr);
+  return quiet_if_possible(deliver(PyTrace_LINE, nullptr), from);
 }
 
 // The trace function's exception argument: (type, value, traceback).
@@ -126,7 +253,7 @@ struct EventCallback {
 
 EventCallback gCallbacks[] = {
     CALLBACK("PY_START", on_call),   CALLBACK("PY_RESUME", on_call),
-    CALLBACK("PY_THROW", on_call),   CALLBACK("PY_RETURN", on_return),
+    CALLBACK("PY_THROW", on_throw),  CALLBACK("PY_RETURN", on_return),
     CALLBACK("PY_YIELD", on_return), CALLBACK("PY_UNWIND", on_unwind),
     CALLBACK("LINE", on_line),       CALLBACK("JUMP", on_jump),
     CALLBACK("RAISE", on_raise),     CALLBACK("STOP_ITERATION", on_stop_iteration),
@@ -134,16 +261,7 @@ EventCallback gCallbacks[] = {
 
 #undef CALLBACK
 
-constexpr size_t kCallbackCount = sizeof(gCallbacks) / sizeof(gCallbacks[0]);
-
-struct MonitoringTool {
-  Ref monitoring;                  // sys.monitoring while the tool is in use
-  Ref tool_id;                     // int: sys.monitoring.DEBUGGER_ID
-  Ref event_bits[kCallbackCount];  // int per callback, read from sys.monitoring.events
-  bool in_use = false;
-};
-
-MonitoringTool gTool;
+static_assert(sizeof(gCallbacks) / sizeof(gCallbacks[0]) == kCallbackCount);
 
 Ref monitoring_module() {
   Ref sys = Ref::steal(PyImport_ImportModule("sys"));
@@ -235,7 +353,8 @@ int monitoring_start() {
   if (!tool_id || check_tool_id_free(monitoring.get(), tool_id.get()) != 0) return -1;
   gTool.monitoring = monitoring;
   gTool.tool_id = tool_id;
-  if (!read_event_bits(monitoring.get())) return -1;
+  gTool.disable = Ref::steal(PyObject_GetAttrString(monitoring.get(), "DISABLE"));
+  if (!gTool.disable || !read_event_bits(monitoring.get())) return -1;
   Ref used = Ref::steal(
       PyObject_CallMethod(monitoring.get(), "use_tool_id", "Os", tool_id.get(), kToolName));
   if (!used) return -1;
@@ -248,8 +367,21 @@ int monitoring_start() {
     failure.restore();
     return -1;
   }
+  // Places made quiet in an earlier session stay quiet for the id, whoever takes it next.
+  gTool.quiet = true;
+  monitoring_lines_needed();
   do_dprintf(kDbgFlow, "sys.monitoring: events 0x%lx as tool %s\n", mask, kToolName);
   return 0;
+}
+
+void monitoring_lines_needed() {
+  if (!gTool.in_use || !gTool.quiet) return;
+  gTool.quiet = false;
+  compat::PendingError saved;
+  saved.fetch();
+  Ref done = Ref::steal(PyObject_CallMethod(gTool.monitoring.get(), "restart_events", nullptr));
+  if (!done) log_and_clear();
+  saved.restore();
 }
 
 void monitoring_stop() {

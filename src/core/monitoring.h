@@ -34,3 +34,16 @@ int monitoring_start();
 // Switches every event of the tool off, unregisters the callbacks and frees the id. Errors
 // are logged and dropped: stopping must always succeed.
 void monitoring_stop();
+
+// Places that cannot stop go quiet (answer DISABLE) while every thread runs freely (no thread
+// steps or waits to stop or has an injected exception to raise) and no sub-language is
+// registered: a LINE or same-line backward JUMP of a line without a breakpoint in any file; a
+// function's PY_START once its thread has a bottom frame (unless a breakpoint is on its first
+// line, which 3.13+ would not report then); a function's PY_RETURN/PY_YIELD unless it is some
+// thread's bottom frame or holds an exception record. A JUMP that never starts a line again
+// is always quiet. Exception events (RAISE, PY_UNWIND, PY_THROW) never are.
+// Whatever can make a stop possible again calls this before the program runs on: a stepping
+// command, stop, a new breakpoint, an idle period, a sub-language hook, an injected
+// exception, start_trace. It turns every quiet place on again (for every tool: the
+// interpreter knows no narrower way); nothing happens while no place is quiet.
+void monitoring_lines_needed();

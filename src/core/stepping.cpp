@@ -3,6 +3,7 @@
 #include "core/stepping.h"
 
 #include "bp/breakhere.h"
+#include "core/monitoring.h"
 #include "core/sublang.h"
 #include "core/tracercore.h"
 #include "support/dbgcommon.h"
@@ -41,6 +42,8 @@ void set_stepping(ThreadData* data, Ref stop_frame, Ref step_out_frame, int firs
   data->step_out_frame = std::move(step_out_frame);
   data->line_range_start = first;
   data->line_range_end = last;
+  // A command that can stop at a line needs the lines that went quiet (sys.monitoring).
+  if (data->stop_frame || !data->step_out_frame.is_none()) monitoring_lines_needed();
 }
 
 // Nothing stops while the import callback runs or once tracing has stopped, whatever the

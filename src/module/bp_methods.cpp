@@ -3,6 +3,7 @@
 #include <Python.h>
 
 #include "bp/bpops.h"
+#include "core/monitoring.h"
 #include "core/tracercore.h"
 #include "module/methods.h"
 #include "support/dprintf.h"
@@ -35,6 +36,7 @@ PyObject* _tracer_set_break(PyObject*, PyObject* args) {
   do_dprintf(kDbgFlow, "  line = %d, filename = %s\n", lineno, dprint_check_str(file));
   int id = __tracer_set_break(breakpoints(), file, lineno, enabled, temporary, cond, ignore_count);
   if (id == -1) return nullptr;  // MemoryError "Out of memory" is set
+  monitoring_lines_needed();     // its line may have gone quiet
   return PyLong_FromLong(id);
 }
 

@@ -3,6 +3,7 @@
 // reads from the tracer record or a thread's record.
 #include <Python.h>
 
+#include "core/monitoring.h"
 #include "core/thread_policy.h"
 #include "core/tracercore.h"
 #include "module/methods.h"
@@ -20,6 +21,7 @@ PyObject* _tracer_set_idle_period(PyObject*, PyObject* args) {
   float value = 0;
   if (!PyArg_ParseTuple(args, "f:tracer_set_idle_period", &value)) return nullptr;
   gSelf.idle_period = value;
+  if (value > 0) monitoring_lines_needed();  // the idle callback counts events
   Py_RETURN_NONE;
 }
 

@@ -2,6 +2,7 @@
 // thread and what a frame is to it.
 #include <Python.h>
 
+#include "core/monitoring.h"
 #include "core/sublang.h"
 #include "core/tracercore.h"
 #include "module/methods.h"
@@ -21,6 +22,7 @@ PyObject* _tracer_register_sub_language_hook(PyObject*, PyObject* args) {
   PyObject* hook = nullptr;
   if (!PyArg_ParseTuple(args, "O:register_sub_language_hook", &hook)) return nullptr;
   if (__tracer_register_sub_language_hook(hook) != 0) return nullptr;
+  monitoring_lines_needed();  // the hook decides at its own lines
   Py_RETURN_NONE;
 }
 

@@ -3,6 +3,7 @@
 // start and exit hooks, and raise_exception.
 #include <Python.h>
 
+#include "core/monitoring.h"
 #include "core/dispatch.h"
 #include "core/exception_dispatch.h"
 #include "core/install.h"
@@ -140,5 +141,6 @@ PyObject* raise_exception(PyObject*, PyObject* args) {
   ThreadData* data = calling_thread_record();
   if (data == nullptr) return nullptr;
   if (!__tracer_set_pending_exception(data, exc)) return nullptr;
+  monitoring_lines_needed();  // raised at the thread's next event, which must come
   Py_RETURN_NONE;
 }
