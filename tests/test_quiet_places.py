@@ -102,3 +102,50 @@ def test_places_quiet_in_an_earlier_session_are_reported_in_the_next(tmp_path):
                          timeout=TIMEOUT)
     assert out.returncode == 0, out.stderr
     assert out.stdout == "[8, 8, 8]\n"
+
+
+def test_stepping_into_a_function_that_was_stepped_over_stops_inside_it(tmp_path):
+    # While the first call is stepped over, the callee's places may go quiet; stepping into
+    # the second call must find them reported again.
+    program = """
+    def f(x):
+        y = x + 1
+        return y
+
+    for i in range(2):
+        f(i)
+    print("done")
+    """
+    run = ok(run_traced(tmp_path, program, first="continue_run",
+                        breaks=[[str(tmp_path / "prog.py"), 6, 1, 0, None, 0]],
+                        commands=["step_over", "step_over", "step_into"], max_stops=4,
+                        probe="frame.f_locals.get('i', frame.f_locals.get('x'))"))
+    assert_stops(run.stops, [
+        ("line", "prog.py", 6, "<module>", 0),
+        ("line", "prog.py", 5, "<module>", 0),
+        ("line", "prog.py", 6, "<module>", 1),
+        ("line", "prog.py", 2, "f", 1),
+    ])
+    assert run.stdout == "done\n"
+
+
+def test_a_line_range_stepped_over_stops_in_the_caller_when_the_frame_returns(tmp_path):
+    # Stepping over lines 2-3 of f: f returns inside the range, so the stop comes at the
+    # caller's next line, a place that ran freely before.
+    program = """
+    def f(x):
+        y = x + 1
+        return y
+
+    f(0)
+    f(1)
+    print("done")
+    """
+    prog = str(tmp_path / "prog.py")
+    run = ok(run_traced(tmp_path, program, first="continue_run",
+                        breaks=[[prog, 2, 1, 0, None, 1]],
+                        commands=[["step_over_line_range", 2, 3]], max_stops=2))
+    assert_stops(run.stops, [
+        ("line", "prog.py", 2, "f"),
+        ("line", "prog.py", 7, "<module>"),
+    ])

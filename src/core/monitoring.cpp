@@ -63,32 +63,48 @@ PyObject* on_unwind(PyObject*, PyObject* const*, Py_ssize_t) {
 
 // ---- Quiet places -----------------------------------------------------------------------------
 
-bool any_thread_may_stop_at_a_line() {
-  if (gSelf.pending_exception_count != 0) return true;
+bool is_frame_of(const Ref& frame, PyCodeObject* code) {
+  if (!frame || !compat::is_plain_frame(frame.get())) return false;
+  PyCodeObject* frame_code = PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(frame.get()));
+  Py_DECREF(frame_code);
+  return frame_code == code;
+}
+
+// Whether no thread's stepping can stop in `code`. A thread that runs freely cannot; one that
+// stops at the next event anywhere (step into, stop) or steps over a line range (it stops in
+// any frame once the stop frame has left) can stop anywhere; one that steps over a frame or
+// out of one stops only in the stop frame's code and at the step-out frame's return (both
+// frames' returns stay reported, and an exception leaving them always is).
+bool threads_leave_code_alone(PyCodeObject* code) {
+  if (gSelf.pending_exception_count != 0) return false;  // raised at the next event
   CU_HashSearch search;
   for (CU_HashEntry* entry = CU_FirstHashEntry(&gSelf.thread_table, &search); entry != nullptr;
        entry = CU_NextHashEntry(&search)) {
     auto* data = static_cast<ThreadData*>(CU_GetHashValue(entry));
     if (data == nullptr) continue;
-    if (data->stop_frame || (data->step_out_frame && !data->step_out_frame.is_none())) return true;
+    if (data->stop_frame && (data->stop_frame.is_none() || data->line_range_start != -1 ||
+                             is_frame_of(data->stop_frame, code))) {
+      return false;
+    }
+    if (is_frame_of(data->step_out_frame, code)) return false;
   }
-  return false;
+  return true;
 }
 
-// Running freely everywhere: no thread steps, waits to stop or has an exception to raise, and
-// no sub-language decides at its frames. (The idle callback runs at most once a second, on
-// the events that still come; a server side that wants a thread to stop gives it a command,
-// which brings every place back.)
-bool all_run_freely() {
-  return !gSelf.sub_language.enabled && gSelf.trace_started && !any_thread_may_stop_at_a_line();
+// Nothing can stop in `code` but a breakpoint: no thread's stepping, no sub-language deciding
+// at its frames. (The idle callback runs at most once a second, on the events that still
+// come; a server side that wants a thread to stop gives it a command, which brings every
+// place back.)
+bool run_freely_in(PyCodeObject* code) {
+  return !gSelf.sub_language.enabled && gSelf.trace_started && threads_leave_code_alone(code);
 }
 
 bool has_breakpoint_line(long line) {
   return __tracer_bps_at_line(&gSelf.bp_ops_data, static_cast<int32_t>(line)) != nullptr;
 }
 
-bool line_may_go_quiet(long line) {
-  return !has_breakpoint_line(line) && all_run_freely();
+bool line_may_go_quiet(PyCodeObject* code, long line) {
+  return !has_breakpoint_line(line) && run_freely_in(code);
 }
 
 PyCodeObject* function_code(PyFrameObject* frame) {  // new reference, or null
@@ -116,10 +132,9 @@ bool is_bot_frame_code_of_a_thread(PyCodeObject* code) {
 // (From 3.13 on a function written on its header line loses its first LINE where PY_START is
 // quiet: not while that line has a breakpoint.)
 bool call_may_go_quiet(PyFrameObject* frame) {
-  if (!all_run_freely()) return false;
   PyCodeObject* code = function_code(frame);
   if (code == nullptr) return false;
-  bool quiet = !has_breakpoint_line(code->co_firstlineno);
+  bool quiet = !has_breakpoint_line(code->co_firstlineno) && run_freely_in(code);
   Py_DECREF(code);
   if (!quiet) return false;
   ThreadData* data = find_thread_data(&gSelf.thread_table, PyThreadState_Get());
@@ -129,10 +144,9 @@ bool call_may_go_quiet(PyFrameObject* frame) {
 // A function's returns tell the running core nothing unless it is some thread's bottom frame
 // (autoquit, the thread policy) or holds an exception record to forget.
 bool return_may_go_quiet(PyFrameObject* frame) {
-  if (!all_run_freely()) return false;
   PyCodeObject* code = function_code(frame);
   if (code == nullptr) return false;
-  bool quiet = !is_bot_frame_code_of_a_thread(code);
+  bool quiet = run_freely_in(code) && !is_bot_frame_code_of_a_thread(code);
   Py_DECREF(code);
   return quiet && (!gSelf.exc_data.frame_exc_info ||
                    find_frame_exc_info(&gSelf.exc_data.frame_exc_info,
@@ -159,8 +173,11 @@ PyObject* on_return(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
 
 // The answer to a line event that went through the dispatcher: DISABLE where the place may go
 // quiet, else what the dispatcher answered.
-PyObject* quiet_if_possible(PyObject* answer, long line) {
-  if (answer != Py_None || !gTool.disable || !line_may_go_quiet(line)) return answer;
+PyObject* quiet_if_possible(PyObject* answer, PyObject* code, long line) {
+  if (answer != Py_None || !gTool.disable || !PyCode_Check(code) ||
+      !line_may_go_quiet(reinterpret_cast<PyCodeObject*>(code), line)) {
+    return answer;
+  }
   Py_DECREF(answer);
   gTool.quiet = true;
   return gTool.disable.new_ref();
@@ -174,7 +191,7 @@ PyObject* on_line(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
     PyErr_Clear();
     return answer;
   }
-  return quiet_if_possible(answer, line);
+  return quiet_if_possible(answer, args[0], line);
 }
 
 int line_of(PyObject* code, PyObject* offset) {
@@ -199,7 +216,7 @@ PyObject* on_jump(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
     gTool.quiet = true;
     return gTool.disable.new_ref();
   }
-  return quiet_if_possible(deliver(PyTrace_LINE, nullptr), from);
+  return quiet_if_possible(deliver(PyTrace_LINE, nullptr), args[0], from);
 }
 
 // The trace function's exception argument: (type, value, traceback).

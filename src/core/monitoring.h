@@ -35,9 +35,11 @@ int monitoring_start();
 // are logged and dropped: stopping must always succeed.
 void monitoring_stop();
 
-// Places that cannot stop go quiet (answer DISABLE) while every thread runs freely (no thread
-// steps or waits to stop or has an injected exception to raise) and no sub-language is
-// registered: a LINE or same-line backward JUMP of a line without a breakpoint in any file; a
+// Places that cannot stop go quiet (answer DISABLE) where no thread's stepping can stop in
+// their code (a thread running freely cannot; one stepping over or out of a frame stops only
+// in that frame's code; one stepping into, told to stop, stepping over a line range or with
+// an injected exception to raise can stop anywhere) and no sub-language is registered: a
+// LINE or same-line backward JUMP of a line without a breakpoint in any file; a
 // function's PY_START once its thread has a bottom frame (unless a breakpoint is on its first
 // line, which 3.13+ would not report then); a function's PY_RETURN/PY_YIELD unless it is some
 // thread's bottom frame or holds an exception record. A JUMP that never starts a line again
