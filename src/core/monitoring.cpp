@@ -38,7 +38,10 @@ struct MonitoringTool {
   bool quiet = false;  // some place answered DISABLE since the last restart
 };
 
-MonitoringTool gTool;
+// Never destroyed: the interpreter is gone by the time static objects are, and the tool's
+// references must not be released then.
+NoDestructor<MonitoringTool> gToolStorage;
+MonitoringTool& gTool = gToolStorage.get();
 
 // ---- Mapping the events ---------------------------------------------------------------------
 
