@@ -181,7 +181,9 @@ def _init_core(core, line_cb, return_cb, exception_cb):
 
 
 def _check_core_installed():
-    if os.environ.get("SELVANE_EVENT_SOURCE") == "monitoring":
+    source = os.environ.get("SELVANE_EVENT_SOURCE") or (
+        "monitoring" if hasattr(sys, "monitoring") else "settrace")
+    if source == "monitoring":
         if sys.monitoring.get_tool(sys.monitoring.DEBUGGER_ID) != "selvane":
             raise Failed("start_trace() did not take the sys.monitoring debugger tool id")
     elif sys.gettrace() is None:

@@ -19,8 +19,10 @@ HERE = os.path.dirname(os.path.abspath(__file__))
 SERVER = os.path.join(HERE, "scripted_server.py")
 RECORDER = os.path.join(HERE, "line_recorder.py")
 TIMEOUT = 120
-# The event source the core takes its events from in this run (the suite runs on both).
-MONITORING = os.environ.get("SELVANE_EVENT_SOURCE") == "monitoring"
+# The event source the core takes its events from in this run (the suite runs on both):
+# sys.monitoring where the interpreter has it, unless SELVANE_EVENT_SOURCE says otherwise.
+MONITORING = (os.environ.get("SELVANE_EVENT_SOURCE") or
+              ("monitoring" if hasattr(sys, "monitoring") else "settrace")) == "monitoring"
 
 
 @dataclass

@@ -349,9 +349,25 @@ void log_and_clear() {
 
 }  // namespace
 
+bool monitoring_available() {
+  Ref sys = Ref::steal(PyImport_ImportModule("sys"));
+  if (!sys) {
+    PyErr_Clear();
+    return false;
+  }
+  int has = PyObject_HasAttrString(sys.get(), "monitoring");
+  return has == 1;
+}
+
 int read_event_source_setting(int* source) {
   const char* value = std::getenv("SELVANE_EVENT_SOURCE");
-  if (value == nullptr || value[0] == '\0' || std::strcmp(value, "settrace") == 0) {
+  if (value == nullptr || value[0] == '\0') {
+    // sys.monitoring where the interpreter has it: a program then runs at its untraced speed
+    // wherever it cannot stop.
+    *source = monitoring_available() ? kEventsFromMonitoring : kEventsFromTrace;
+    return 0;
+  }
+  if (std::strcmp(value, "settrace") == 0) {
     *source = kEventsFromTrace;
     return 0;
   }

@@ -23,8 +23,9 @@
 
 #include <Python.h>
 
-// SELVANE_EVENT_SOURCE as init reads it: "settrace" or "monitoring" (unset or empty: the
-// default). 0 with the choice stored in *source, or -1 with ValueError (an unknown value) or
+// SELVANE_EVENT_SOURCE as init reads it: "settrace" or "monitoring"; unset or empty, the
+// default: sys.monitoring where the interpreter has it (3.12+), else the trace function. 0
+// with the choice stored in *source, or -1 with ValueError (an unknown value) or
 // RuntimeError (monitoring asked for where the interpreter has no sys.monitoring).
 int read_event_source_setting(int* source);
 
