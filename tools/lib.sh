@@ -63,7 +63,7 @@ ensure_venv() {  # name -> path of the venv's python (in $SELVANE_VENVS if set n
   fi
   # The marker holds the list installed, so that a venv made before a tool joined the list
   # gets it on the next run.
-  local tools=("scikit-build-core>=0.8" cmake ninja "pytest>=7" "pexpect>=4.8")
+  local tools=("scikit-build-core>=0.8" cmake ninja "pytest>=7" "pexpect>=4.8" "coverage>=7.4")
   if [ "$(cat "$venv/.tools-installed" 2>/dev/null)" != "${tools[*]}" ]; then
     pip_quietly "$venv/bin/python" install -q --disable-pip-version-check "${tools[@]}" >&2 \
       || return 1
