@@ -20,6 +20,15 @@ ROOT_DEBUG_VERSIONS=(3.13 3.14 3.15)
 
 log() { printf '\n=== %s\n' "$*"; }
 
+has_monitoring() {  # name -> whether that interpreter has sys.monitoring (3.12 and later)
+  local minor
+  case "$1" in
+    dbg) return 1 ;;  # Debian 12's python3.11-dbg
+    3.*) minor="${1#3.}"; minor="${minor%%.*}"; minor="${minor%d}"; ((minor >= 12)) ;;
+    *) return 1 ;;
+  esac
+}
+
 python_for() {  # name -> interpreter path
   case "$1" in
     dbg) echo "$DEBUG_PYTHON" ;;
