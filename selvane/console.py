@@ -306,8 +306,9 @@ class Console(cmd.Cmd, Frontend):
         return self._resume(self.session.until, line)
 
     def do_jump(self, arg):
-        """jump (j) LINE: make LINE the next line to run in the current frame (only where
-        the program stopped; not into or out of a loop or block)."""
+        """jump (j) LINE: make LINE the next line to run in the current frame (only in the
+        frame where the program stopped, at a line stop; not into or out of a loop or
+        block)."""
         line = _int_arg(arg, "jump")
         self.session.jump(line)
         self.say(f"next line: {line}")

@@ -115,6 +115,23 @@ class Frontend:
         raise NotImplementedError
 
 
+# CO_GENERATOR, CO_COROUTINE and CO_ASYNC_GENERATOR (inspect has them by name, but the
+# debugger does not load modules the program may not use).
+_SUSPENDING_CODE = 0x20 | 0x100 | 0x200
+
+
+def _suspends(frame):
+    """Whether a return stop in `frame` is a generator or coroutine suspending (a yield or
+    an await), rather than its code ending. The instruction the frame stands at tells."""
+    if not frame.f_code.co_flags & _SUSPENDING_CODE:
+        return False
+    # The frame stands at its YIELD_VALUE (up to 3.12), or at the RESUME right after it
+    # (3.13 and later).
+    code = frame.f_code.co_code
+    return any(0 <= offset < len(code) and dis.opname[code[offset]] == "YIELD_VALUE"
+               for offset in (frame.f_lasti, frame.f_lasti - 2))
+
+
 def _own_files():
     """Full names of the debugger's own modules, as the core reports frame files."""
     names = set()
@@ -476,22 +493,44 @@ class Session:
         self._set_resume("quit")
 
     def jump(self, line):
-        """Makes `line` the next line to run in the stopped frame."""
+        """Makes `line` the next line to run in the stopped frame.
+
+        Only that frame, and only at a line stop. Setting the line of any other frame (a
+        caller, or a frame of another thread) is accepted by 3.13 to 3.15 and then crashes
+        the interpreter when that frame resumes; at a return stop the frame is leaving (and
+        at a generator's yield, 3.14 and later give up the yield in progress); at an
+        exception stop the exception is on its way. None of these is attempted."""
         stop = self.stop
         if stop is None:
             raise SessionError("the program is not stopped")
         if self.frame is not stop.frame:
-            raise SessionError("can only jump in the frame where the program stopped "
-                               "(go back there with `down`)")
+            where = ("go back there with `down`" if self._is_caller(self.frame, stop.frame)
+                     else "select it with `thread` and `down`")
+            raise SessionError("can only jump in the frame where the program stopped, not "
+                               f"in another frame ({where})")
+        if stop.kind == "return":
+            leaving = ("is suspending at a yield" if _suspends(stop.frame)
+                       else "is returning")
+            raise SessionError(f"cannot jump here: the function {leaving}; jump works at a "
+                               "line stop (`step` to one first)")
         if stop.kind != "line":
-            raise SessionError("can only jump at a line stop, not at a "
-                               f"{stop.kind} stop")
+            raise SessionError(f"cannot jump at an {stop.kind} stop: jump works at a line "
+                               "stop (`step` to one first)")
         if self._key_hook(stop.frame) is not None:
             raise SessionError("cannot jump in a sub-language's code, only in Python code")
         try:
             stop.frame.f_lineno = line
         except ValueError as error:
             raise SessionError(f"cannot jump to line {line}: {error}") from None
+
+    @staticmethod
+    def _is_caller(frame, of):
+        """Whether `frame` is one of the frames that led to `of`."""
+        while of is not None:
+            of = of.f_back
+            if of is frame:
+                return True
+        return False
 
     # ---- frames and threads ----------------------------------------------------------------
 

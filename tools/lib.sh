@@ -20,6 +20,15 @@ ROOT_DEBUG_VERSIONS=(3.13 3.14 3.15)
 
 log() { printf '\n=== %s\n' "$*"; }
 
+has_monitoring() {  # name -> whether that interpreter has sys.monitoring (3.12 and later)
+  local minor
+  case "$1" in
+    dbg) return 1 ;;  # Debian 12's python3.11-dbg
+    3.*) minor="${1#3.}"; minor="${minor%%.*}"; minor="${minor%d}"; ((minor >= 12)) ;;
+    *) return 1 ;;
+  esac
+}
+
 python_for() {  # name -> interpreter path
   case "$1" in
     dbg) echo "$DEBUG_PYTHON" ;;
@@ -63,7 +72,7 @@ ensure_venv() {  # name -> path of the venv's python (in $SELVANE_VENVS if set n
   fi
   # The marker holds the list installed, so that a venv made before a tool joined the list
   # gets it on the next run.
-  local tools=("scikit-build-core>=0.8" cmake ninja "pytest>=7" "pexpect>=4.8")
+  local tools=("scikit-build-core>=0.8" cmake ninja "pytest>=7" "pexpect>=4.8" "coverage>=7.4")
   if [ "$(cat "$venv/.tools-installed" 2>/dev/null)" != "${tools[*]}" ]; then
     pip_quietly "$venv/bin/python" install -q --disable-pip-version-check "${tools[@]}" >&2 \
       || return 1
