@@ -139,19 +139,34 @@ def test_unknown_source_after_a_good_init_keeps_the_first(tmp_path):
     assert stops == [["target", stops[0][1]]]
 
 
-@pytest.mark.parametrize("value", [None, "", "settrace"])
-def test_trace_function_is_the_default_and_takes_no_tool_id(tmp_path, value):
-    result, _ = run_script(tmp_path, """
-        core.init(*init_args(line_cb=line_cb))
-        core.set_break(__file__, TARGET_LINE, 1, 0, None, 0)
-        core.start_trace()
-        during = [sys.gettrace() is not None, monitoring_state()]
-        target()
-        core.stop_trace()
-        print(json.dumps([during, stops]))
-    """, value)
+DEFAULT_SOURCE_SCRIPT = """
+    core.init(*init_args(line_cb=line_cb))
+    core.set_break(__file__, TARGET_LINE, 1, 0, None, 0)
+    core.start_trace()
+    during = [sys.gettrace() is not None, monitoring_state()]
+    target()
+    core.stop_trace()
+    print(json.dumps([during, stops]))
+"""
+
+
+def test_settrace_takes_the_trace_function_and_no_tool_id(tmp_path):
+    result, _ = run_script(tmp_path, DEFAULT_SOURCE_SCRIPT, "settrace")
     during, stops = result
     assert during == [True, [None, 0] if HAS_MONITORING else None]
+    assert [s[0] for s in stops] == ["target"]
+
+
+@pytest.mark.parametrize("value", [None, ""])
+def test_the_default_is_sys_monitoring_where_the_interpreter_has_it(tmp_path, value):
+    result, _ = run_script(tmp_path, DEFAULT_SOURCE_SCRIPT, value)
+    during, stops = result
+    if HAS_MONITORING:
+        tracing, (tool, events) = during
+        assert (tracing, tool) == (False, "selvane")
+        assert events != 0
+    else:
+        assert during == [True, None]
     assert [s[0] for s in stops] == ["target"]
 
 
