@@ -9,19 +9,10 @@ import subprocess
 import sys
 
 from console_driver import Session, environment, stop_line, write
+from templang.samples import HOOK, ORDER_PAGE as PAGE
 
 HERE = os.path.dirname(os.path.abspath(__file__))
-HOOK = "templang.debughook:TemplateHook"
 
-PAGE = """\
-Order for {{ customer }}
-{% set total = 0 %}
-{% for name, qty, price in items %}
-- {{ name }}: {{ money(qty * price) }}
-{% set total = total + qty * price %}
-{% end %}
-Total: {{ money(total) }}
-"""
 
 PROGRAM = """
 from templang import render

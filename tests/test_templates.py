@@ -24,18 +24,8 @@ import textwrap
 import pytest
 
 from conftest import HERE, TIMEOUT, assert_stops, run_traced, write_program
+from templang.samples import HOOK, ORDER_PAGE as PAGE
 
-HOOK = "templang.debughook:TemplateHook"
-
-PAGE = """\
-Order for {{ customer }}
-{% set total = 0 %}
-{% for name, qty, price in items %}
-- {{ name }}: {{ money(qty * price) }}
-{% set total = total + qty * price %}
-{% end %}
-Total: {{ money(total) }}
-"""
 
 PROGRAM = """
 from templang import render
