@@ -2,8 +2,10 @@
 debugpy installed (debugpy's threads and its adapter process must not share a process with
 the other modes).
 
-Usage: python debugpy_child.py ITERATIONS REPEATS
-Prints one JSON line: {"times": [seconds, ...], "tracer": ...} or {"skip": reason}.
+Usage: python debugpy_child.py ITERATIONS REPEATS [WORKLOAD,...]
+WORKLOAD is a key of run_bench.WORKLOADS (main, exc, gen, thr; default main).
+Prints one JSON line: {"times": [seconds, ...] (of main), "times_by_workload": {workload:
+[seconds, ...]}, "tracer": ...} or {"skip": reason}.
 
 The setting is the one a user of an editor has: debugpy listens on the loopback interface,
 a client (a second process started from here, speaking the Debug Adapter Protocol) attaches,
@@ -106,7 +108,7 @@ def tracer_in_use():
     return None
 
 
-def run_program(iterations, repeats):
+def run_program(iterations, repeats, workloads=("main",)):
     try:
         import debugpy
     except ImportError:
@@ -129,10 +131,13 @@ def run_program(iterations, repeats):
         tracer = tracer_in_use()
         if tracer is None:
             return {"skip": "debugpy attached but nothing traces this thread"}
-        times = []
-        for _ in range(repeats + 1):
-            times.append(run_bench.run_once_timed(iterations))
-        return {"times": times[1:], "tracer": tracer, "debugpy": debugpy.__version__}
+        by_workload = {}
+        for kind in workloads:
+            work = run_bench.WORKLOADS[kind]
+            times = [run_bench.run_once_timed(iterations, work) for _ in range(repeats + 1)]
+            by_workload[kind] = times[1:]
+        return {"times": by_workload.get("main", []), "times_by_workload": by_workload,
+                "tracer": tracer, "debugpy": debugpy.__version__}
     finally:
         client.terminate()
         client.wait(timeout=10)
@@ -142,9 +147,10 @@ def main():
     if len(sys.argv) == 5 and sys.argv[1] == "client":
         run_client(int(sys.argv[2]), sys.argv[3], int(sys.argv[4]))
         return
-    if len(sys.argv) != 3:
+    if len(sys.argv) not in (3, 4):
         sys.exit(__doc__)
-    result = run_program(int(sys.argv[1]), int(sys.argv[2]))
+    workloads = sys.argv[3].split(",") if len(sys.argv) == 4 else ["main"]
+    result = run_program(int(sys.argv[1]), int(sys.argv[2]), workloads)
     print(json.dumps(result), flush=True)
     # debugpy's threads and adapter need not be waited for: the run is over.
     os._exit(0)

@@ -1,6 +1,7 @@
 """What one trace event costs in the debugger core, against the floor of a C trace function.
 
 Usage: python run_bench.py [--iterations N] [--repeats R] [--only MODE,...] [--json]
+                           [--event-source settrace|monitoring|both]
                            [--null-tracer-dir DIR] [--debugpy-python PYTHON]
 
 Runs the workload of workload.py under each mode below, on the interpreter that runs this
@@ -47,12 +48,29 @@ Modes:
   debugpy         debugpy (if --debugpy-python names an interpreter that has it) with a
                   client attached over loopback and a breakpoint on that unreached line; it
                   runs in a process of its own (see debugpy_child.py)
+  gen-*           the generator workload (workload.gen_workload: yield from, and a coroutine
+                  driven by send): gen-untraced, gen-null-c (its floor), gen-core-free,
+                  gen-core-bp-unreached, gen-bdb, gen-debugpy
+  thr-*           the two-thread workload (workload.thread_workload: two threads run the
+                  workload at once, the time is the wall time of both): thr-untraced,
+                  thr-null-c (the null tracer installed in each thread: its floor),
+                  thr-core-free, thr-core-bp-unreached, thr-bdb (bdb's trace function given
+                  to the new threads with threading.settrace), thr-debugpy
+
+Event sources: every mode of the core (a name with "core" in it) runs once per event source
+that --event-source selects (default "both" where the interpreter has sys.monitoring, else
+settrace): SELVANE_EVENT_SOURCE is set before the core's init and restored after each run,
+and the row is labelled "MODE [settrace]" or "MODE [monitoring]". The other modes do not
+depend on the source and run once.
 
 The number of events is counted once with a sys.settrace counter over one workload call, and
-checked against what the counting variant of the null C tracer sees. The exc-* modes run the
-exception workload: their events are counted on it, and their floor is exc-null-c.
+checked against what the counting variant of the null C tracer sees. The exc-*, gen-* and
+thr-* modes run their own workload: their events are counted on it (thr-*: in both threads,
+with threading.settrace), and their floor is their own null-c mode.
 
-With --json the results also go to results-<python version>.json beside this script.
+With --json the results also go to results-<python version>.json beside this script: "modes"
+is keyed by the row label, and each row names its "mode" and "event_source" (null for the
+modes that do not depend on it).
 """
 
 import argparse
@@ -63,6 +81,7 @@ import platform
 import statistics
 import subprocess
 import sys
+import threading
 import time
 
 HERE = os.path.dirname(os.path.abspath(__file__))
@@ -176,8 +195,14 @@ class _CallbackCounter:
 
 
 def _init_core(core, line_cb, return_cb, exception_cb):
-    core.init(0.0, 0, _noop, _noop, line_cb, return_cb, exception_cb, _noop, None,
-              _ORIGINAL_IMPORT, None, {})
+    def install_thread_hooks(flag):
+        # What the server side does (selvane/session.py): threads started while the core
+        # traces are bootstrapped by it (needed by the trace-function source; sys.monitoring
+        # sees every thread anyway).
+        threading._trace_hook = core.bootstrap_new_thread if flag else None
+
+    core.init(0.0, 0, install_thread_hooks, _noop, line_cb, return_cb, exception_cb, _noop,
+              None, _ORIGINAL_IMPORT, None, {})
 
 
 def _check_core_installed():
@@ -229,7 +254,7 @@ def mode_exc_core_unhandled(n):
     return mode_core_free(n, wl.exc_workload, exception_mode=2)
 
 
-def _run_core_with_breakpoint(n, filename, line):
+def _run_core_with_breakpoint(n, filename, line, work=None):
     core = _core()
     counter = _CallbackCounter()
     _init_core(core, counter.line, counter.ret, counter.exc)
@@ -238,7 +263,7 @@ def _run_core_with_breakpoint(n, filename, line):
     core.start_trace()
     try:
         _check_core_installed()
-        elapsed = timed(n)
+        elapsed = timed(n, work)
     finally:
         core.stop_trace()
         core.reset()
@@ -261,8 +286,8 @@ def mode_core_bp_elsewhere(n):
     return _run_core_with_breakpoint(n, __file__, line)
 
 
-def mode_core_bp_unreached(n):
-    return _run_core_with_breakpoint(n, wl.__file__, never_reached_line(wl.never_called))
+def mode_core_bp_unreached(n, work=None):
+    return _run_core_with_breakpoint(n, wl.__file__, never_reached_line(wl.never_called), work)
 
 
 class _BenchHook:
@@ -426,14 +451,19 @@ def _bdb_class():
     return _FreeRunningBdb
 
 
-def _run_bdb(n, filename, line):
+def _run_bdb(n, filename, line, work=None, threads=False):
     debugger = _bdb_class()()
     error = debugger.set_break(filename, line)
     if error:
         raise Failed(f"bdb refused the breakpoint: {error}")
+    if threads:
+        # bdb traces the thread it runs in; the workload's threads get its trace function
+        # as pdb users give it to them, with threading.settrace.
+        threading.settrace(debugger.trace_dispatch)
     try:
-        elapsed = debugger.runcall(timed, n)
+        elapsed = debugger.runcall(timed, n, work)
     finally:
+        threading.settrace(None)
         # Breakpoints are global to the Bdb class: a new instance loads those of the old
         # ones, and the next run must see only its own.
         debugger.clear_all_breaks()
@@ -442,12 +472,50 @@ def _run_bdb(n, filename, line):
     return elapsed
 
 
-def mode_bdb(n):
-    return _run_bdb(n, wl.__file__, never_reached_line(wl.never_called))
+def mode_bdb(n, work=None, threads=False):
+    return _run_bdb(n, wl.__file__, never_reached_line(wl.never_called), work, threads)
 
 
 def mode_bdb_elsewhere(n):
     return _run_bdb(n, __file__, never_reached_line(_never_called_here))
+
+
+# ---- the generator and two-thread workloads --------------------------------------------------
+
+
+def _null_in_each_thread(work, n):
+    tracer = _null_tracer()
+    tracer.install()
+    try:
+        work(n)
+    finally:
+        tracer.uninstall()
+
+
+def _threads_under_null(n):
+    wl.thread_workload(n, per_thread=_null_in_each_thread)
+
+
+def mode_gen_untraced(n):
+    return timed(n, wl.gen_workload)
+
+
+def mode_gen_null(n):
+    tracer = _null_tracer()
+    tracer.install()
+    try:
+        return timed(n, wl.gen_workload)
+    finally:
+        tracer.uninstall()
+
+
+def mode_thr_untraced(n):
+    return timed(n, wl.thread_workload)
+
+
+def mode_thr_null(n):
+    _null_tracer()
+    return timed(n, _threads_under_null)
 
 
 MODES = {
@@ -466,12 +534,62 @@ MODES = {
     "exc-core-unhandled": mode_exc_core_unhandled,
     "bdb": mode_bdb,
     "bdb-elsewhere": mode_bdb_elsewhere,
+    "gen-untraced": mode_gen_untraced,
+    "gen-null-c": mode_gen_null,
+    "gen-core-free": lambda n: mode_core_free(n, wl.gen_workload),
+    "gen-core-bp-unreached": lambda n: mode_core_bp_unreached(n, wl.gen_workload),
+    "gen-bdb": lambda n: mode_bdb(n, wl.gen_workload),
+    "thr-untraced": mode_thr_untraced,
+    "thr-null-c": mode_thr_null,
+    "thr-core-free": lambda n: mode_core_free(n, wl.thread_workload),
+    "thr-core-bp-unreached": lambda n: mode_core_bp_unreached(n, wl.thread_workload),
+    "thr-bdb": lambda n: mode_bdb(n, wl.thread_workload, threads=True),
     # debugpy runs in a process of its own: see measure_debugpy().
 }
+DEBUGPY_MODES = {"debugpy": "main", "gen-debugpy": "gen", "thr-debugpy": "thr"}
 FLOOR = "null-c"
 # The modes that run the exception workload, and their floor.
 EXC_MODES = ("exc-untraced", "exc-null-c", "exc-core-never", "exc-core-unhandled")
 EXC_FLOOR = "exc-null-c"
+# Each workload by the prefix of its modes' names.
+WORKLOADS = {"main": wl.workload, "exc": wl.exc_workload, "gen": wl.gen_workload,
+             "thr": wl.thread_workload}
+SOURCES = ("settrace", "monitoring")
+
+
+def workload_of(mode):
+    """The workload a mode (or a row label) runs: "main", "exc", "gen" or "thr"."""
+    prefix = mode.split("-", 1)[0]
+    return prefix if prefix in WORKLOADS else "main"
+
+
+def floor_of(mode):
+    kind = workload_of(mode)
+    return FLOOR if kind == "main" else f"{kind}-null-c"
+
+
+def untraced_of(mode):
+    kind = workload_of(mode)
+    return "untraced" if kind == "main" else f"{kind}-untraced"
+
+
+def is_core_mode(mode):
+    """Whether a mode runs the core, and so depends on the event source."""
+    return "core" in mode.split("-")
+
+
+def available_sources():
+    return SOURCES if hasattr(sys, "monitoring") else ("settrace",)
+
+
+def label(mode, source):
+    return f"{mode} [{source}]" if source else mode
+
+
+def runs_of(modes, sources):
+    """(mode, source) pairs: a core mode once per source, the others once with None."""
+    return [(mode, source) for mode in modes
+            for source in (sources if is_core_mode(mode) else (None,))]
 
 
 # ---- event count ----------------------------------------------------------------------------
@@ -480,16 +598,20 @@ EXC_FLOOR = "exc-null-c"
 def count_events(n, work=None):
     """The events of one workload(n) call, by kind, as sys.settrace sees them."""
     counts = {}
+    lock = threading.Lock()
 
     def trace(frame, event, arg):
-        counts[event] = counts.get(event, 0) + 1
+        with lock:  # the two-thread workload's threads count into one table
+            counts[event] = counts.get(event, 0) + 1
         return trace
 
+    threading.settrace(trace)
     sys.settrace(trace)
     try:
         (work or wl.workload)(n)
     finally:
         sys.settrace(None)
+        threading.settrace(None)
     return counts
 
 
@@ -511,12 +633,13 @@ def count_events_in_c(n):
 # ---- debugpy, in its own process ------------------------------------------------------------
 
 
-def measure_debugpy(python, iterations, repeats):
-    """Runs debugpy_child.py under `python` (an interpreter that has debugpy); returns the
-    list of times and a note on how debugpy traced, or raises Skip."""
+def measure_debugpy(python, iterations, repeats, workloads=("main",)):
+    """Runs debugpy_child.py under `python` (an interpreter that has debugpy); returns
+    {workload: list of times} and a note on how debugpy traced, or raises Skip."""
     if not python:
         raise Skip("no --debugpy-python given")
-    command = [python, os.path.join(HERE, "debugpy_child.py"), str(iterations), str(repeats)]
+    command = [python, os.path.join(HERE, "debugpy_child.py"), str(iterations), str(repeats),
+               ",".join(workloads)]
     # The check it skips warns about breakpoints in frozen standard modules, on stderr.
     env = dict(os.environ, PYDEVD_DISABLE_FILE_VALIDATION="1")
     try:
@@ -529,63 +652,84 @@ def measure_debugpy(python, iterations, repeats):
     result = json.loads(done.stdout.strip().splitlines()[-1])
     if "skip" in result:
         raise Skip(result["skip"])
-    return result["times"], f"debugpy {result['debugpy']} traced through {result['tracer']}"
+    times = result.get("times_by_workload") or {"main": result["times"]}
+    return times, f"debugpy {result['debugpy']} traced through {result['tracer']}"
 
 
 # ---- driver ---------------------------------------------------------------------------------
 
 
-def run_once(mode, n):
+def run_once(mode, n, source=None):
+    """One run of a mode; a core mode under `source` (SELVANE_EVENT_SOURCE, read by the
+    core's init, is set for the run and restored after it)."""
+    saved = os.environ.get("SELVANE_EVENT_SOURCE")
+    if source:
+        os.environ["SELVANE_EVENT_SOURCE"] = source
     gc.collect()
     gc.disable()
     try:
         return MODES[mode](n)
     finally:
         gc.enable()
+        if saved is None:
+            os.environ.pop("SELVANE_EVENT_SOURCE", None)
+        else:
+            os.environ["SELVANE_EVENT_SOURCE"] = saved
 
 
-def run_once_timed(n):
+def run_once_timed(n, work=None):
     """One timed() run on the same terms as run_once(), for a tracer installed by the caller
     (debugpy_child.py)."""
     gc.collect()
     gc.disable()
     try:
-        return timed(n)
+        return timed(n, work)
     finally:
         gc.enable()
 
 
-def measure(modes, iterations, repeats):
-    """Times each mode `repeats` times in rotating rounds, after one warm-up run each.
-    Returns {mode: list of seconds} and {mode: reason} for the modes that were skipped."""
-    times = {mode: [] for mode in modes}
+def measure(runs, iterations, repeats):
+    """Times each (mode, source) run `repeats` times in rotating rounds, after one warm-up
+    run each. Returns {label: list of seconds} and {label: reason} for the runs that were
+    skipped."""
+    times = {label(*run): [] for run in runs}
     skipped = {}
-    for mode in modes:  # warm-up: first-run costs (imports, instrumenting code) stay out
+    for run in runs:  # warm-up: first-run costs (imports, instrumenting code) stay out
         try:
-            run_once(mode, iterations)
+            run_once(run[0], iterations, run[1])
         except Skip as exc:
-            skipped[mode] = str(exc)
-    active = [mode for mode in modes if mode not in skipped]
+            skipped[label(*run)] = str(exc)
+    active = [run for run in runs if label(*run) not in skipped]
     for round_number in range(repeats):
         shift = round_number % len(active) if active else 0
-        for mode in active[shift:] + active[:shift]:
-            times[mode].append(run_once(mode, iterations))
-    return {mode: times[mode] for mode in active}, skipped
+        for run in active[shift:] + active[:shift]:
+            times[label(*run)].append(run_once(run[0], iterations, run[1]))
+    return {label(*run): times[label(*run)] for run in active}, skipped
 
 
-def summarise(times, events, exc_events=None):
+def mode_and_source(row_label):
+    mode, _, rest = row_label.partition(" [")
+    return mode, (rest.rstrip("]") or None)
+
+
+def summarise(times, events_by_workload):
     rows = {}
-    for mode, values in times.items():
-        floor_mode = EXC_FLOOR if mode in EXC_MODES else FLOOR
-        floor = min(times[floor_mode]) if floor_mode in times else None
-        n_events = exc_events if mode in EXC_MODES else events
+    for row_label, values in times.items():
+        mode, source = mode_and_source(row_label)
+        floor = min(times[floor_of(mode)]) if floor_of(mode) in times else None
+        untraced = min(times[untraced_of(mode)]) if untraced_of(mode) in times else None
+        n_events = events_by_workload[workload_of(mode)]
         best = min(values)
-        rows[mode] = {
+        rows[row_label] = {
+            "mode": mode,
+            "event_source": source,
+            "workload": workload_of(mode),
             "best_s": best,
             "median_s": statistics.median(values),
             "ns_per_event": best / n_events * 1e9,
             "ns_per_event_above_floor": (best - floor) / n_events * 1e9 if floor else None,
             "ratio_to_floor": best / floor if floor else None,
+            "ratio_to_untraced": best / untraced if untraced else None,
             "times_s": values,
         }
     return rows
@@ -599,19 +743,54 @@ def print_table(rows, skipped, events, counts, c_counts, iterations, repeats):
         seen = sum(c_counts.values())
         print(f"  the counting C tracer saw {seen} events over the timed span "
               f"({seen - events:+d}: the timing line's own events)")
-    header = (f"{'mode':<20}{'best s':>10}{'median s':>10}{'ns/event':>10}"
-              f"{'+ns over null':>15}{'x null':>8}")
+    header = (f"{'mode':<36}{'best s':>10}{'median s':>10}{'ns/event':>10}"
+              f"{'+ns over null':>15}{'x null':>8}{'x untraced':>12}")
     print(header)
     print("-" * len(header))
-    for mode, row in rows.items():
+    for row_label, row in rows.items():
         above = row["ns_per_event_above_floor"]
         ratio = row["ratio_to_floor"]
-        print(f"{mode:<20}{row['best_s']:>10.4f}{row['median_s']:>10.4f}"
+        ratio_u = row["ratio_to_untraced"]
+        print(f"{row_label:<36}{row['best_s']:>10.4f}{row['median_s']:>10.4f}"
               f"{row['ns_per_event']:>10.1f}"
               f"{(f'{above:+.1f}' if above is not None else '-'):>15}"
-              f"{(f'{ratio:.2f}' if ratio is not None else '-'):>8}")
-    for mode, reason in skipped.items():
-        print(f"{mode:<20}skipped: {reason}")
+              f"{(f'{ratio:.2f}' if ratio is not None else '-'):>8}"
+              f"{(f'{ratio_u:.2f}' if ratio_u is not None else '-'):>12}")
+    for row_label, reason in skipped.items():
+        print(f"{row_label:<36}skipped: {reason}")
+
+
+def targets(rows):
+    """The issue's targets that this run's rows can tell: (what, figure, met or None)."""
+    found = []
+
+    def best(row_label):
+        return rows[row_label]["best_s"] if row_label in rows else None
+
+    for mode in ("core-bp-elsewhere", "core-bp-unreached", "core-free"):
+        value = rows.get(label(mode, "monitoring"), {}).get("ratio_to_untraced")
+        if value is not None:
+            found.append((f"{mode} [monitoring] within 1.05x of untraced", f"{value:.3f}x",
+                          value <= 1.05))
+    for debugpy_mode in DEBUGPY_MODES:
+        theirs = best(debugpy_mode)
+        if theirs is None:
+            continue
+        kind = workload_of(debugpy_mode)
+        prefix = "" if kind == "main" else f"{kind}-"
+        # The target is for sys.monitoring where the interpreter has it (3.11: settrace).
+        for source in (("monitoring",) if hasattr(sys, "monitoring") else ("settrace",)):
+            ours = best(label(f"{prefix}core-bp-unreached", source))
+            if ours is not None:
+                found.append((f"{prefix}core-bp-unreached [{source}] at least as fast as "
+                              f"{debugpy_mode}", f"{ours / theirs:.2f}x debugpy's time",
+                              ours <= theirs))
+    step_trace, step_mon = best(label("core-step-over", "settrace")), best(
+        label("core-step-over", "monitoring"))
+    if step_trace and step_mon:
+        found.append(("core-step-over [monitoring] no slower than [settrace]",
+                      f"{step_mon / step_trace:.2f}x", step_mon <= step_trace))
+    return found
 
 
 def main(argv=None):
@@ -621,6 +800,10 @@ def main(argv=None):
     parser.add_argument("--repeats", type=int, default=7, help="timed runs per mode")
     parser.add_argument("--only", default="",
                         help="comma-separated modes to run (default: all)")
+    parser.add_argument("--event-source", default="both",
+                        choices=("settrace", "monitoring", "both"),
+                        help="event sources of the core modes (default: both where the "
+                             "interpreter has sys.monitoring)")
     parser.add_argument("--json", action="store_true",
                         help=f"also write results-{VERSION}.json beside this script")
     parser.add_argument("--null-tracer-dir",
@@ -634,13 +817,20 @@ def main(argv=None):
     args = parser.parse_args(argv)
 
     sys.path.insert(0, args.null_tracer_dir)
-    wanted = [m for m in args.only.split(",") if m] or list(MODES) + ["debugpy"]
-    unknown = [m for m in wanted if m not in MODES and m != "debugpy"]
+    known = list(MODES) + list(DEBUGPY_MODES)
+    wanted = [m for m in args.only.split(",") if m] or known
+    unknown = [m for m in wanted if m not in known]
     if unknown:
-        parser.error(f"unknown modes {unknown}; known: {list(MODES) + ['debugpy']}")
+        parser.error(f"unknown modes {unknown}; known: {known}")
+    sources = available_sources() if args.event_source == "both" else (args.event_source,)
+    if "monitoring" in sources and not hasattr(sys, "monitoring"):
+        parser.error(f"CPython {VERSION} has no sys.monitoring")
 
-    counts = count_events(args.iterations)
-    events = sum(counts.values())
+    kinds_wanted = {workload_of(m) for m in wanted} | {"main"}
+    counts_by_workload = {kind: count_events(args.iterations, WORKLOADS[kind])
+                          for kind in WORKLOADS if kind in kinds_wanted}
+    events_by_workload = {kind: sum(c.values()) for kind, c in counts_by_workload.items()}
+    counts, events = counts_by_workload["main"], events_by_workload["main"]
     c_counts = None if args.under_callgrind else count_events_in_c(args.iterations)
     if args.under_callgrind:
         use_callgrind_clock()
@@ -649,33 +839,48 @@ def main(argv=None):
               file=sys.stderr)
 
     try:
-        times, skipped = measure([m for m in wanted if m in MODES], args.iterations,
-                                 args.repeats)
+        times, skipped = measure(runs_of([m for m in wanted if m in MODES], sources),
+                                 args.iterations, args.repeats)
     except Failed as exc:
         print(f"error: {exc}", file=sys.stderr)
         return 1
     notes = {}
-    if "debugpy" in wanted and not args.under_callgrind:
+    debugpy_wanted = [m for m in wanted if m in DEBUGPY_MODES]
+    if debugpy_wanted and not args.under_callgrind:
         try:
-            times["debugpy"], notes["debugpy"] = measure_debugpy(
-                args.debugpy_python, args.iterations, args.repeats)
+            by_workload, notes["debugpy"] = measure_debugpy(
+                args.debugpy_python, args.iterations, args.repeats,
+                [DEBUGPY_MODES[m] for m in debugpy_wanted])
+            for mode in debugpy_wanted:
+                times[mode] = by_workload[DEBUGPY_MODES[mode]]
         except Skip as exc:
-            skipped["debugpy"] = str(exc)
-    exc_counts = (count_events(args.iterations, wl.exc_workload)
-                  if any(m in EXC_MODES for m in wanted) else {})
-    exc_events = sum(exc_counts.values())
-    rows = summarise(times, events, exc_events)
+            for mode in debugpy_wanted:
+                skipped[mode] = str(exc)
+    rows = summarise(times, events_by_workload)
     print_table(rows, skipped, events, counts, c_counts, args.iterations, args.repeats)
-    if exc_counts:
-        kinds = ", ".join(f"{kind} {count}" for kind, count in sorted(exc_counts.items()))
-        print(f"exc-* modes: the exception workload, {exc_events} events per run ({kinds}); "
-              f"their floor is {EXC_FLOOR}")
-    if "exc-core-never" in rows and "exc-core-unhandled" in rows:
-        ratio = rows["exc-core-unhandled"]["best_s"] / rows["exc-core-never"]["best_s"]
-        rows["exc-core-unhandled"]["ratio_to_exc_core_never"] = ratio
-        print(f"exc-core-unhandled / exc-core-never: {ratio:.2f} (aim: at most 2)")
+    print(f"event sources of the core modes: {', '.join(sources)}")
+    for kind, kind_counts in counts_by_workload.items():
+        if kind == "main":
+            continue
+        kinds = ", ".join(f"{k} {c}" for k, c in sorted(kind_counts.items()))
+        print(f"{kind}-* modes: workload.{WORKLOADS[kind].__name__}, "
+              f"{events_by_workload[kind]} events per run ({kinds}); their floor is "
+              f"{kind}-null-c")
+    for source in sources:
+        never = rows.get(label("exc-core-never", source))
+        unhandled = rows.get(label("exc-core-unhandled", source))
+        if never and unhandled:
+            ratio = unhandled["best_s"] / never["best_s"]
+            unhandled["ratio_to_exc_core_never"] = ratio
+            print(f"exc-core-unhandled / exc-core-never [{source}]: {ratio:.2f} "
+                  "(aim: at most 2)")
     for mode, note in notes.items():
         print(f"{mode}: {note}")
+    found = targets(rows)
+    if found:
+        print("targets (wall time, best of the repeats):")
+        for what, figure, met in found:
+            print(f"  {'met   ' if met else 'missed'}  {what}: {figure}")
 
     if args.json:
         path = os.path.join(HERE, f"results-{VERSION}.json")
@@ -687,14 +892,17 @@ def main(argv=None):
                 "cpus": os.cpu_count(),
                 "iterations": args.iterations,
                 "repeats": args.repeats,
+                "event_sources": list(sources),
                 "events_per_run": events,
                 "events_by_kind": counts,
-                "exc_events_per_run": exc_events,
-                "exc_events_by_kind": exc_counts,
+                "exc_events_per_run": events_by_workload.get("exc", 0),
+                "exc_events_by_kind": counts_by_workload.get("exc", {}),
+                "events_per_run_by_workload": events_by_workload,
                 "floor": FLOOR,
                 "modes": rows,
                 "skipped": skipped,
                 "notes": notes,
+                "targets": [{"what": w, "figure": fig, "met": met} for w, fig, met in found],
             }, f, indent=2)
             f.write("\n")
         print(f"wrote {path}")

@@ -10,7 +10,18 @@ out, so that every iteration makes exception events (three: one in raise_here, o
 raise_out and one in the loop's frame) besides its calls, lines and returns. Every exception
 is caught: a debugger that stops only on unhandled exceptions must analyse each one and never
 stop.
+
+gen_workload: generators and a coroutine. Each iteration takes one value from a generator
+that delegates to another with `yield from` (both frames resume and suspend), then sends it
+into a coroutine driven by `send` (resume, two lines, suspend): call and return events come
+from resumed frames, and the delegating frame sees the inner generator's end.
+
+thread_workload: two threads, started here, each running workload(n) at once; the caller
+waits for both, so a timed call is the wall time of both. `per_thread`, when given, wraps each
+thread's run (a tracer that must be installed thread by thread).
 """
+
+import threading
 
 
 def leaf(x):
@@ -52,3 +63,45 @@ def exc_workload(n):
         except KeyError:
             total += 1
     return total
+
+
+def inner_gen(n):
+    for i in range(n):
+        yield i
+    return n
+
+
+def outer_gen(n):
+    end = yield from inner_gen(n)
+    yield end
+
+
+def accumulator():
+    total = 0
+    while True:
+        value = yield total
+        total += value
+
+
+def gen_workload(n):
+    coroutine = accumulator()
+    next(coroutine)
+    total = 0
+    for value in outer_gen(n):
+        total = coroutine.send(value)
+    coroutine.close()
+    return total
+
+
+def thread_workload(n, per_thread=None):
+    def run():
+        if per_thread is None:
+            workload(n)
+        else:
+            per_thread(workload, n)
+
+    threads = [threading.Thread(target=run) for _ in range(2)]
+    for thread in threads:
+        thread.start()
+    for thread in threads:
+        thread.join()
