@@ -1,6 +1,7 @@
 """Instructions per trace event for each mode of run_bench.py, counted by valgrind's callgrind.
 
 Usage: python count_instructions.py [--iterations N] [--only MODE,...] [--json]
+                                    [--event-source settrace|monitoring|both]
                                     [--null-tracer-dir DIR] [--keep DIR]
 
 Wall times on a shared two-core machine move with whatever else runs there; instruction
@@ -11,8 +12,12 @@ is what the workload costs per event under that mode, in instructions, with no n
 does not see cache misses or branch mispredictions, which the wall times do.
 
 --keep DIR leaves the callgrind output files there, one per mode, for callgrind_annotate
-(`callgrind_annotate --inclusive=yes DIR/callgrind.core-free.out`).
-With --json the results go to instructions-<python version>.json beside this script.
+(`callgrind_annotate --inclusive=yes "DIR/callgrind.core-free [monitoring].out"`).
+As in run_bench.py, each mode of the core is counted once per event source (--event-source,
+default both where the interpreter has sys.monitoring) and its row is labelled with it; each
+mode's instructions are divided by the events of its own workload.
+With --json the results go to instructions-<python version>.json beside this script
+("instructions_per_event" keyed by the row label).
 """
 
 import argparse
@@ -40,13 +45,13 @@ def collected_instructions(out_file):
     raise RuntimeError(f"no totals in {out_file}")
 
 
-def count_mode(mode, args, out_dir):
-    out_file = os.path.join(out_dir, f"callgrind.{mode}.out")
+def count_mode(mode, source, args, out_dir):
+    out_file = os.path.join(out_dir, f"callgrind.{run_bench.label(mode, source)}.out")
     command = [
         "valgrind", "--tool=callgrind", "--collect-atstart=no", f"--callgrind-out-file={out_file}",
         sys.executable, os.path.join(HERE, "run_bench.py"), "--only", mode, "--repeats", "1",
         "--iterations", str(args.iterations), "--null-tracer-dir", args.null_tracer_dir,
-        "--under-callgrind",
+        "--under-callgrind", "--event-source", source or "both",
     ]
     done = subprocess.run(command, capture_output=True, text=True)
     if done.returncode != 0:
@@ -66,6 +71,8 @@ def main(argv=None):
                         default=os.path.join(run_bench.ROOT, "build",
                                              f"bench-null-tracer-{run_bench.VERSION}"))
     parser.add_argument("--keep", default="", help="folder for the callgrind output files")
+    parser.add_argument("--event-source", default="both",
+                        choices=("settrace", "monitoring", "both"))
     args = parser.parse_args(argv)
 
     if shutil.which("valgrind") is None:
@@ -74,34 +81,44 @@ def main(argv=None):
     if not run_bench._null_tracer().HAS_CALLGRIND:
         sys.exit("_null_tracer was built without valgrind/callgrind.h: rebuild it")
     modes = [m for m in args.only.split(",") if m] or list(run_bench.MODES)
-    events = sum(run_bench.count_events(args.iterations).values())
+    sources = (run_bench.available_sources() if args.event_source == "both"
+               else (args.event_source,))
+    events_by_workload = {
+        kind: sum(run_bench.count_events(args.iterations, run_bench.WORKLOADS[kind]).values())
+        for kind in {run_bench.workload_of(m) for m in modes} | {"main"}}
+    events = events_by_workload["main"]
 
     out_dir = args.keep or tempfile.mkdtemp(prefix="callgrind-")
     os.makedirs(out_dir, exist_ok=True)
     per_event = {}
     try:
-        for mode in modes:
-            total = count_mode(mode, args, out_dir)
+        for mode, source in run_bench.runs_of(modes, sources):
+            total = count_mode(mode, source, args, out_dir)
             if total is not None:
-                per_event[mode] = total / (RUNS_PER_MODE * events)
+                per_event[run_bench.label(mode, source)] = total / (
+                    RUNS_PER_MODE * events_by_workload[run_bench.workload_of(mode)])
     finally:
         if not args.keep:
             shutil.rmtree(out_dir, ignore_errors=True)
 
-    floor = per_event.get(run_bench.FLOOR)
-    print(f"CPython {run_bench.VERSION}, {args.iterations} iterations, {events} events per run, "
-          "instructions counted by callgrind")
-    print(f"{'mode':<16}{'instr/event':>12}{'+ over null':>13}{'x null':>8}")
-    for mode, value in per_event.items():
+    print(f"CPython {run_bench.VERSION}, {args.iterations} iterations, {events} events per run "
+          f"(by workload: {events_by_workload}), instructions counted by callgrind")
+    print(f"{'mode':<36}{'instr/event':>12}{'+ over null':>13}{'x null':>8}{'x untraced':>12}")
+    for row_label, value in per_event.items():
+        mode, _ = run_bench.mode_and_source(row_label)
+        floor = per_event.get(run_bench.floor_of(mode))
+        untraced = per_event.get(run_bench.untraced_of(mode))
         above = f"{value - floor:+.0f}" if floor else "-"
         ratio = f"{value / floor:.2f}" if floor else "-"
-        print(f"{mode:<16}{value:>12.0f}{above:>13}{ratio:>8}")
+        ratio_u = f"{value / untraced:.3f}" if untraced else "-"
+        print(f"{row_label:<36}{value:>12.0f}{above:>13}{ratio:>8}{ratio_u:>12}")
     if args.json:
         path = os.path.join(HERE, f"instructions-{run_bench.VERSION}.json")
         with open(path, "w") as f:
             json.dump({"python": run_bench.VERSION, "iterations": args.iterations,
-                       "events_per_run": events, "instructions_per_event": per_event}, f,
-                      indent=2)
+                       "event_sources": list(sources), "events_per_run": events,
+                       "events_per_run_by_workload": events_by_workload,
+                       "instructions_per_event": per_event}, f, indent=2)
             f.write("\n")
         print(f"wrote {path}")
     if args.keep:

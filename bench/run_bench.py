@@ -121,6 +121,8 @@ def use_callgrind_clock():
     """Makes timed() switch callgrind's collection on and off around the workload."""
     global perf_counter
     perf_counter = _null_tracer().callgrind_clock
+    # Collection is per thread: the two-thread workload's threads switch it themselves.
+    wl.thread_span = perf_counter
 
 
 def never_reached_line(function):

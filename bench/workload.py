@@ -93,12 +93,22 @@ def gen_workload(n):
     return total
 
 
+# Called at the start and at the end of each thread's run when set: run_bench.py sets it under
+# callgrind, whose collection is switched on and off thread by thread.
+thread_span = None
+
+
 def thread_workload(n, per_thread=None):
     def run():
+        span = thread_span
+        if span is not None:
+            span()
         if per_thread is None:
             workload(n)
         else:
             per_thread(workload, n)
+        if span is not None:
+            span()
 
     threads = [threading.Thread(target=run) for _ in range(2)]
     for thread in threads:
