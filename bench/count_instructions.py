@@ -62,6 +62,27 @@ def count_mode(mode, source, args, out_dir):
     return collected_instructions(out_file)
 
 
+def count_debugpy(mode, args, out_dir):
+    """The debugpy mode's instructions: debugpy_child.py under callgrind, one workload, a
+    warm-up and one timed run; only the program's main thread is counted (debugpy's own
+    threads wait on their sockets while the workload runs)."""
+    out_file = os.path.join(out_dir, f"callgrind.{mode}.out")
+    command = [
+        "valgrind", "--tool=callgrind", "--collect-atstart=no", f"--callgrind-out-file={out_file}",
+        args.debugpy_python, os.path.join(HERE, "debugpy_child.py"), str(args.iterations), "1",
+        run_bench.DEBUGPY_MODES[mode],
+    ]
+    env = dict(os.environ, PYDEVD_DISABLE_FILE_VALIDATION="1",
+               BENCH_CALLGRIND_NULL_TRACER=os.path.abspath(args.null_tracer_dir))
+    done = subprocess.run(command, capture_output=True, text=True, env=env, timeout=1800)
+    lines = done.stdout.strip().splitlines()
+    if done.returncode != 0 or not lines or "skip" in json.loads(lines[-1]):
+        tail = "\n".join((done.stderr.strip().splitlines() + lines)[-3:])
+        print(f"{mode}: not counted ({tail})", file=sys.stderr)
+        return None
+    return collected_instructions(out_file)
+
+
 def main(argv=None):
     parser = argparse.ArgumentParser(description=__doc__.splitlines()[0])
     parser.add_argument("--iterations", type=int, default=10_000)
@@ -73,6 +94,9 @@ def main(argv=None):
     parser.add_argument("--keep", default="", help="folder for the callgrind output files")
     parser.add_argument("--event-source", default="both",
                         choices=("settrace", "monitoring", "both"))
+    parser.add_argument("--debugpy-python", default="",
+                        help="interpreter (same version) that has debugpy: the debugpy modes "
+                             "are counted too when they are asked for with --only")
     args = parser.parse_args(argv)
 
     if shutil.which("valgrind") is None:
@@ -81,6 +105,9 @@ def main(argv=None):
     if not run_bench._null_tracer().HAS_CALLGRIND:
         sys.exit("_null_tracer was built without valgrind/callgrind.h: rebuild it")
     modes = [m for m in args.only.split(",") if m] or list(run_bench.MODES)
+    unknown = [m for m in modes if m not in run_bench.MODES and m not in run_bench.DEBUGPY_MODES]
+    if unknown:
+        parser.error(f"unknown modes {unknown}")
     sources = (run_bench.available_sources() if args.event_source == "both"
                else (args.event_source,))
     events_by_workload = {
@@ -93,7 +120,10 @@ def main(argv=None):
     per_event = {}
     try:
         for mode, source in run_bench.runs_of(modes, sources):
-            total = count_mode(mode, source, args, out_dir)
+            if mode in run_bench.DEBUGPY_MODES:
+                total = count_debugpy(mode, args, out_dir) if args.debugpy_python else None
+            else:
+                total = count_mode(mode, source, args, out_dir)
             if total is not None:
                 per_event[run_bench.label(mode, source)] = total / (
                     RUNS_PER_MODE * events_by_workload[run_bench.workload_of(mode)])

@@ -12,7 +12,10 @@ a client (a second process started from here, speaking the Debug Adapter Protoco
 sets one breakpoint on a line of the workload's file that is never reached, and finishes the
 configuration; the program then runs freely. The times are of run_bench.timed(), as for the
 other modes: a warm-up run, then REPEATS timed runs. With BENCH_DAP_TRACE=1 in the
-environment the client prints every protocol message it receives to stderr.
+environment the client prints every protocol message it receives to stderr. With
+BENCH_CALLGRIND_NULL_TRACER=DIR (count_instructions.py sets it when it runs this script under
+callgrind) the timed spans switch callgrind's collection on and off, with the _null_tracer
+built in DIR.
 """
 
 import itertools
@@ -116,6 +119,9 @@ def run_program(iterations, repeats, workloads=("main",)):
     import run_bench
     import workload
 
+    if os.environ.get("BENCH_CALLGRIND_NULL_TRACER"):
+        sys.path.insert(0, os.environ["BENCH_CALLGRIND_NULL_TRACER"])
+        run_bench.use_callgrind_clock()
     line = run_bench.never_reached_line(workload.never_called)
     # The client process below is ours, not a program to debug: debugpy must not follow it.
     debugpy.configure(subProcess=False)
