@@ -64,8 +64,9 @@ def count_mode(mode, source, args, out_dir):
 
 def count_debugpy(mode, args, out_dir):
     """The debugpy mode's instructions: debugpy_child.py under callgrind, one workload, a
-    warm-up and one timed run; only the program's main thread is counted (debugpy's own
-    threads wait on their sockets while the workload runs)."""
+    warm-up and one timed run; the program's threads are counted (the two-thread workload's
+    switch collection themselves), debugpy's own threads are not: they wait on their sockets
+    while the workload runs."""
     out_file = os.path.join(out_dir, f"callgrind.{mode}.out")
     command = [
         "valgrind", "--tool=callgrind", "--collect-atstart=no", f"--callgrind-out-file={out_file}",
