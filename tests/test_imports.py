@@ -130,6 +130,45 @@ def test_every_execution_of_module_code_is_listed_once(tmp_path):
     assert again == []
 
 
+# The list keeps every execution up to this many entries; past it only paths not listed yet.
+LIST_LIMIT = 10000
+
+REPEATED_EXECUTIONS = """
+import tvantrel30pydebugstackless as core
+try:
+    import _scripted_shared as shared
+except ImportError:  # the untraced run
+    import types
+    shared = types.ModuleType("plain")
+here = os.path.dirname(__file__)
+code = compile("z = 3", os.path.join(here, "compiled.py"), "exec")
+for _ in range(LIMIT + 500):
+    exec(code, {})
+exec(compile("w = 1", os.path.join(here, "other.py"), "exec"), {})
+exec(code, {})
+shared.full = core.get_new_imports()
+exec(code, {})
+exec(code, {})
+print("done")
+"""
+
+
+def test_a_list_nobody_fetches_stops_growing_with_repeated_executions(tmp_path):
+    """Module code executed over and over while the list is not fetched: every execution is
+    listed until the limit, then only paths not listed yet; a fetched list starts afresh."""
+    run = traced(tmp_path, REPEATED_EXECUTIONS.replace("LIMIT", str(LIST_LIMIT)),
+                 after_stop="[shared.full, core.get_new_imports()]")
+    full, after_fetch = run.after_stop
+    assert len(full) == LIST_LIMIT + 1
+    kept = ours(tmp_path, full[:LIST_LIMIT])
+    assert kept[0] == "prog.py"
+    assert set(kept[1:]) == {"compiled.py"}
+    # Until the limit every execution counts: what is not ours came before the loop.
+    assert full[LIST_LIMIT - 1] == full[LIST_LIMIT - 2] == str(tmp_path / "compiled.py")
+    assert ours(tmp_path, full[LIST_LIMIT:]) == ["other.py"]
+    assert ours(tmp_path, after_fetch) == ["compiled.py", "compiled.py"]
+
+
 def test_the_list_is_handed_over_not_copied(tmp_path):
     source = """
     import beta

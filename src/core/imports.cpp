@@ -68,6 +68,35 @@ bool is_pseudo_path(const char* path) {
   return length > 0 && path[0] == '<' && path[length - 1] == '>';
 }
 
+// The set of the paths in the new-imports list, made when the list first reaches its limit
+// and kept up to date from then on (until the list is handed over). Borrowed, or null with
+// an error pending.
+PyObject* listed_paths() {
+  if (!gSelf.new_imports_listed) {
+    gSelf.new_imports_listed = Ref::steal(PySet_New(gSelf.new_imports.get()));
+  }
+  return gSelf.new_imports_listed.get();
+}
+
+// Appends an executed module's path to the new-imports list; past the list's limit only a
+// path not listed yet. 0, or -1 with an error pending.
+int append_new_import(PyObject* path) {
+  PyObject* list = gSelf.new_imports.get();
+  if (PyList_GET_SIZE(list) >= kNewImportsKeepEveryExecution) {
+    PyObject* listed = listed_paths();
+    if (listed == nullptr) return -1;
+    int known = PySet_Contains(listed, path);
+    if (known != 0) {
+      if (known > 0) do_dprintf(kDbgFlow, "MODULE LIST FULL: ALREADY LISTED\n");
+      return known > 0 ? 0 : -1;
+    }
+    if (PySet_Add(listed, path) != 0) return -1;
+  }
+  if (PyList_Append(list, path) != 0) return -1;
+  do_dprintf(kDbgFlow, "ADDED TO MODULE LIST\n");
+  return 0;
+}
+
 }  // namespace
 
 void __tracer_install_import_hook() {
@@ -233,9 +262,16 @@ int __tracer_detect_module_reloads(PyObject* code) {
     return 0;
   }
   Ref text = Ref::steal(gPtrTo_PyUnicode_FromString(path));
-  if (!text || !gSelf.new_imports || PyList_Append(gSelf.new_imports.get(), text.get()) != 0) {
-    return -1;
-  }
-  do_dprintf(kDbgFlow, "ADDED TO MODULE LIST\n");
-  return 0;
+  if (!text || !gSelf.new_imports) return -1;
+  return append_new_import(text.get());
+}
+
+PyObject* take_new_imports() {
+  Ref fresh = Ref::steal(PyList_New(0));
+  if (!fresh) return nullptr;
+  Ref current = gSelf.new_imports ? gSelf.new_imports : Ref::steal(PyList_New(0));
+  if (!current) return nullptr;
+  gSelf.new_imports = fresh;
+  gSelf.new_imports_listed.reset();
+  return current.release();
 }

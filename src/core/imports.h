@@ -25,3 +25,12 @@ void initial_module_scan();
 // 0, or -1 with an error pending.
 int __tracer_top_level_call(PyObject* frame);
 int __tracer_detect_module_reloads(PyObject* code);
+
+// The new-imports list keeps every execution, duplicates included, up to this many entries.
+// Past it a path already listed is not added again (a new path still is), so that a program
+// that executes module code over and over while the server side never fetches the list
+// cannot grow it without bound: it stays within this size plus the number of distinct files.
+inline constexpr Py_ssize_t kNewImportsKeepEveryExecution = 10000;
+// Puts a new empty new-imports list in place and hands back the one it replaces (owned; null
+// with MemoryError pending, the list in force then stays).
+PyObject* take_new_imports();

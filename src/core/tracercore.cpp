@@ -150,6 +150,7 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
   Ref new_imports = Ref::steal(PyList_New(0));
   if (!new_imports) return 0;
   s.new_imports = new_imports;
+  s.new_imports_listed.reset();
   s.installed_import_hook.reset();
   s.in_import_cb = 0;
   s.import_hook_depth = 0;
@@ -180,6 +181,7 @@ void __tracer_reset() {
   Ref new_imports = Ref::steal(PyList_New(0));
   if (new_imports) {
     s.new_imports = new_imports;
+    s.new_imports_listed.reset();
   } else {
     PyErr_Clear();  // keep the old list rather than none: get_new_imports still answers
   }

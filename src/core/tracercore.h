@@ -71,6 +71,7 @@ struct TracerState {
   FileOpsData* file_ops_data = nullptr;  // owned, made at module load
   BpOpsData bp_ops_data;
   Ref new_imports;            // owned list of full path names
+  Ref new_imports_listed;     // owned set of the paths in new_imports once it is full, or null
   Ref installed_import_hook;  // the replacement __import__ once installed, or null
   Ref default_import;         // owned: the builtins' own __import__
   Ref import_cb;              // owned: None or callable

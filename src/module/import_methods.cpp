@@ -9,12 +9,7 @@
 
 PyObject* _tracer_get_new_imports(PyObject*, PyObject*) {
   // The list is handed over, not copied; a new empty one takes its place.
-  Ref fresh = Ref::steal(PyList_New(0));
-  if (!fresh) return nullptr;
-  Ref current = gSelf.new_imports ? gSelf.new_imports : Ref::steal(PyList_New(0));
-  if (!current) return nullptr;
-  gSelf.new_imports = fresh;
-  return current.release();
+  return take_new_imports();
 }
 
 PyObject* _tracer_set_import_cb(PyObject*, PyObject* args) {
