@@ -51,6 +51,8 @@ Configuration keys:
                    ignore_count, hit_count], ...]]
   import_cb        give the core an import callback that appends ["import", module name,
                    thread name] to the events
+  idle_exec        Python source the idle callback runs after recording (names: core, shared,
+                   server, threading, time)
   import_cb_exec   Python source that callback runs after recording (names: core, shared,
                    server, module, threading)
   sub_languages    list of "module:object" sub-language hooks (an object, or a class called
@@ -78,6 +80,7 @@ import os
 import runpy
 import sys
 import threading
+import time
 import types
 
 import tvantrel30pydebugstackless as core
@@ -267,6 +270,9 @@ class Server:
 
     def idle_cb(self):
         self.events.append(["idle"])
+        if "idle_exec" in self.config:
+            exec(self.config["idle_exec"], {"core": core, "shared": shared, "server": self,
+                                            "threading": threading, "time": time})
         if self.fail_in == "idle":
             self.fail_in = None
             raise RuntimeError("idle callback failure")

@@ -1,13 +1,14 @@
 """Switching tracing on and off, containment of failures, injected exceptions, the idle
 callback, autoquit and forked children. Every traced program runs in a subprocess."""
 
+import os
 import subprocess
 import sys
 import textwrap
 
 import pytest
 
-from conftest import assert_stops, ok, run_plain, run_traced
+from conftest import MONITORING, assert_stops, ok, run_plain, run_traced
 
 import tvantrel30pydebugstackless as core
 
@@ -234,6 +235,116 @@ def test_idle_callback_runs_at_most_once_a_second(tmp_path):
 def test_idle_period_zero_never_calls_the_idle_callback(tmp_path):
     run = ok(run_traced(tmp_path, SPIN, first="continue_run", idle_period=0.0))
     assert ["idle"] not in run.events
+
+
+SPIN_IN_A_THREAD = """
+    import os, threading, time
+    try:
+        import _scripted_shared as shared
+    except ImportError:  # the untraced run
+        import types
+        shared = types.ModuleType("plain")
+
+    def spin(seconds):
+        end = time.monotonic() + seconds
+        n = 0
+        while time.monotonic() < end:
+            n += 1
+        return n
+
+    def work():
+        shared.spin_window = [time.monotonic()]
+        shared.tasks_while_running = len(os.listdir("/proc/self/task"))
+        spin(3.2)
+        shared.spin_window.append(time.monotonic())
+
+    worker = threading.Thread(target=work)
+    worker.start()
+    worker.join()
+    print("spun")
+"""
+
+TASK_COUNTS = """
+import os, time
+def tasks():
+    return len(os.listdir("/proc/self/task"))
+def settle(target):
+    end = time.monotonic() + 5
+    while tasks() > target and time.monotonic() < end:
+        time.sleep(0.01)
+    return tasks()
+shared.settle = settle
+shared.tasks_before = tasks()
+shared.idle_times = []
+"""
+
+
+@pytest.mark.parametrize("idle_period", [0.5, 0.0])
+def test_idle_callback_runs_while_a_thread_runs_freely(tmp_path, idle_period):
+    """A thread spins in a loop without calls while the main thread waits in join(): the idle
+    callback still runs about once a second during the spin, whichever source delivers the
+    events (sys.monitoring sends none from places that went quiet: a native ticker brings
+    them back while an idle period is set). After stop_trace no thread of the core is left."""
+    run = ok(run_traced(tmp_path, SPIN_IN_A_THREAD, first="continue_run",
+                        idle_period=idle_period, prelude=TASK_COUNTS,
+                        idle_exec="shared.idle_times.append(time.monotonic())",
+                        after_stop="[shared.spin_window, shared.idle_times, shared.tasks_before,"
+                                   " shared.tasks_while_running,"
+                                   " shared.settle(shared.tasks_before)]"))
+    assert run.stdout == "spun\n"
+    (start, end), times, before, running, after = run.after_stop
+    during = [t for t in times if start < t < end]
+    if idle_period > 0:
+        assert len(during) >= 2, (start, end, times)
+        # The worker, and under sys.monitoring the ticker.
+        assert running == before + (2 if MONITORING else 1)
+    else:
+        assert times == []
+        assert running == before + 1
+    assert after == before
+
+
+EXIT_WHILE_TICKING = """
+    import os, sys, time
+    sys.path.insert(0, TESTS)
+    import tvantrel30pydebugstackless as core
+    from core_args import init_args
+
+    def spin(seconds):
+        end = time.monotonic() + seconds
+        while time.monotonic() < end:
+            pass
+
+    idles = []
+    core.init(*init_args(idle_period=0.5, idle_cb=lambda: idles.append(time.monotonic())))
+    core.start_trace()
+    core.continue_run()
+    spin(1.2)
+    pid = os.fork()
+    if pid == 0:
+        spin(0.6)  # the parent's ticker does not exist here; exiting must not wait for it
+        sys.exit(0)
+    forked_at = time.monotonic()
+    _, status = os.waitpid(pid, 0)
+    print("child", os.waitstatus_to_exitcode(status))
+    spin(2.2)
+    print("idle after the fork", any(t > forked_at for t in idles))
+    core.init(*init_args(idle_period=0.5))  # a second session, started again
+    core.start_trace()
+    spin(1.2)
+    print("ending while tracing")
+"""
+
+
+def test_the_process_ends_while_the_idle_ticker_runs(tmp_path):
+    """Tracing still on at exit, the idle ticker running (under sys.monitoring), a forked child
+    that exits normally: both processes end at once and cleanly, the fork warns of no thread
+    of ours, and the idle callback goes on in the parent after the fork."""
+    program = EXIT_WHILE_TICKING.replace("TESTS", repr(os.path.dirname(__file__)))
+    run = run_plain(tmp_path, program)
+    assert run.returncode == 0, run.stderr
+    assert run.stdout == "child 0\nidle after the fork True\nending while tracing\n"
+    assert run.stderr == ""
 
 
 def test_quit_callback_when_the_bottom_frame_returns(tmp_path):

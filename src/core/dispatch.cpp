@@ -14,6 +14,7 @@
 
 #include "bp/breakhere.h"
 #include "core/exception_dispatch.h"
+#include "core/idleticker.h"
 #include "core/imports.h"
 #include "core/install.h"
 #include "core/stepping.h"
@@ -552,6 +553,7 @@ int do_idle() {
   if (!gSelf.trace_started) return -1;
   if (gSelf.in_idle || !(gSelf.idle_period > 0)) return 0;
   gSelf.in_idle = 1;
+  idle_ticker_resume_after_fork();
   if (++gSelf.idle_tick > gSelf.idle_tick_limit) {
     gSelf.idle_tick = 0;
     time_t now = time(nullptr);

@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "core/dispatch.h"
+#include "core/idleticker.h"
 #include "core/imports.h"
 #include "core/monitoring.h"
 #include "core/tracercore.h"
@@ -232,6 +233,7 @@ int __tracer_start_trace() {
   install_tracer(PyInterpreterState_Get());
   set_global_trace_function(1);
   install_start_thread_hooks(1);
+  idle_ticker_update();
   return 1;
 }
 
@@ -242,6 +244,7 @@ void __tracer_stop_trace() {
   set_global_trace_function(0);
   if (monitoring_in_force()) monitoring_stop();
   install_start_thread_hooks(0);
+  idle_ticker_update();
 }
 
 namespace {

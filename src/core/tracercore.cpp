@@ -4,6 +4,7 @@
 
 #include <unistd.h>
 
+#include "core/idleticker.h"
 #include "core/imports.h"
 #include "core/install.h"
 #include "support/dprintf.h"
@@ -165,6 +166,7 @@ int __tracer_init(PyObject* module, float idle_period, int exception_mode,
   // A forked child that initialises starts a session of its own: it is traced again.
   s.in_forked_child = 0;
   init_exc_data(&s.exc_data);
+  idle_ticker_update();  // tracing is not started after init: a ticker of the earlier session ends
   return hook_failed ? 0 : 1;
 }
 

@@ -3,6 +3,7 @@
 // reads from the tracer record or a thread's record.
 #include <Python.h>
 
+#include "core/idleticker.h"
 #include "core/monitoring.h"
 #include "core/thread_policy.h"
 #include "core/tracercore.h"
@@ -22,6 +23,7 @@ PyObject* _tracer_set_idle_period(PyObject*, PyObject* args) {
   if (!PyArg_ParseTuple(args, "f:tracer_set_idle_period", &value)) return nullptr;
   gSelf.idle_period = value;
   if (value > 0) monitoring_lines_needed();  // the idle callback counts events
+  idle_ticker_update();
   Py_RETURN_NONE;
 }
 

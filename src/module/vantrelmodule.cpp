@@ -8,6 +8,7 @@
 #include <pthread.h>
 
 #include "core/dispatch.h"
+#include "core/idleticker.h"
 #include "core/monitoring.h"
 #include "core/tracercore.h"
 #include "exc/handlers.h"
@@ -314,6 +315,9 @@ PyMODINIT_FUNC PyInit_tvantrel30pydebugstackless(void) {
   // The handler analysis reads the interpreter's opcode tables now, never inside an event;
   // when they cannot be read it answers "not caught" everywhere.
   init_handler_analysis();
+  // A ticker that keeps the idle callback going under sys.monitoring must end before the
+  // interpreter finalises.
+  init_idle_ticker();
   // A forked child is never traced; the handler only sets a flag that the next event reads.
   pthread_atfork(nullptr, nullptr, note_fork_in_child);
   do_dprintf(kDbgFlow, "Initialize vantrel module complete\n");
