@@ -18,6 +18,15 @@ default both where the interpreter has sys.monitoring) and its row is labelled w
 mode's instructions are divided by the events of its own workload.
 With --json the results go to instructions-<python version>.json beside this script
 ("instructions_per_event" keyed by the row label).
+
+--libc-malloc runs every counted process with PYTHONMALLOC=malloc. The interpreter's own
+small-object allocator takes a longer path whenever a pool fills up or empties, so a loop that
+makes and drops one integer per iteration pays more or less in it depending on where the pools
+stood when the loop began, which anything allocated earlier (a debugger's start-up included)
+moves: rows that differ by a percent or two can differ only there, with the same number of
+allocations. The C library's allocator serves those same-size requests from a per-thread cache
+at a constant price, so with this option such rows compare the work done per event. The JSON
+file is then instructions-<python version>-libc-malloc.json.
 """
 
 import argparse
@@ -45,6 +54,11 @@ def collected_instructions(out_file):
     raise RuntimeError(f"no totals in {out_file}")
 
 
+def counted_env(args):
+    """The environment of a counted process (--libc-malloc: the C library's allocator)."""
+    return dict(os.environ, PYTHONMALLOC="malloc") if args.libc_malloc else dict(os.environ)
+
+
 def count_mode(mode, source, args, out_dir):
     out_file = os.path.join(out_dir, f"callgrind.{run_bench.label(mode, source)}.out")
     command = [
@@ -53,7 +67,7 @@ def count_mode(mode, source, args, out_dir):
         "--iterations", str(args.iterations), "--null-tracer-dir", args.null_tracer_dir,
         "--under-callgrind", "--event-source", source or "both",
     ]
-    done = subprocess.run(command, capture_output=True, text=True)
+    done = subprocess.run(command, capture_output=True, text=True, env=counted_env(args))
     if done.returncode != 0:
         tail = "\n".join(done.stderr.strip().splitlines()[-5:])
         raise RuntimeError(f"{mode}: run under callgrind failed:\n{tail}")
@@ -73,7 +87,7 @@ def count_debugpy(mode, args, out_dir):
         args.debugpy_python, os.path.join(HERE, "debugpy_child.py"), str(args.iterations), "1",
         run_bench.DEBUGPY_MODES[mode],
     ]
-    env = dict(os.environ, PYDEVD_DISABLE_FILE_VALIDATION="1",
+    env = dict(counted_env(args), PYDEVD_DISABLE_FILE_VALIDATION="1",
                BENCH_CALLGRIND_NULL_TRACER=os.path.abspath(args.null_tracer_dir))
     done = subprocess.run(command, capture_output=True, text=True, env=env, timeout=1800)
     lines = done.stdout.strip().splitlines()
@@ -98,6 +112,8 @@ def main(argv=None):
     parser.add_argument("--debugpy-python", default="",
                         help="interpreter (same version) that has debugpy: the debugpy modes "
                              "are counted too when they are asked for with --only")
+    parser.add_argument("--libc-malloc", action="store_true",
+                        help="count with PYTHONMALLOC=malloc (see the module's docstring)")
     args = parser.parse_args(argv)
 
     if shutil.which("valgrind") is None:
@@ -133,7 +149,8 @@ def main(argv=None):
             shutil.rmtree(out_dir, ignore_errors=True)
 
     print(f"CPython {run_bench.VERSION}, {args.iterations} iterations, {events} events per run "
-          f"(by workload: {events_by_workload}), instructions counted by callgrind")
+          f"(by workload: {events_by_workload}), instructions counted by callgrind"
+          + (", PYTHONMALLOC=malloc" if args.libc_malloc else ""))
     print(f"{'mode':<36}{'instr/event':>12}{'+ over null':>13}{'x null':>8}{'x untraced':>12}")
     for row_label, value in per_event.items():
         mode, _ = run_bench.mode_and_source(row_label)
@@ -142,13 +159,15 @@ def main(argv=None):
         above = f"{value - floor:+.0f}" if floor else "-"
         ratio = f"{value / floor:.2f}" if floor else "-"
         ratio_u = f"{value / untraced:.3f}" if untraced else "-"
-        print(f"{row_label:<36}{value:>12.0f}{above:>13}{ratio:>8}{ratio_u:>12}")
+        print(f"{row_label:<36}{value:>12.1f}{above:>13}{ratio:>8}{ratio_u:>12}")
     if args.json:
-        path = os.path.join(HERE, f"instructions-{run_bench.VERSION}.json")
+        suffix = "-libc-malloc" if args.libc_malloc else ""
+        path = os.path.join(HERE, f"instructions-{run_bench.VERSION}{suffix}.json")
         with open(path, "w") as f:
             json.dump({"python": run_bench.VERSION, "iterations": args.iterations,
                        "event_sources": list(sources), "events_per_run": events,
                        "events_per_run_by_workload": events_by_workload,
+                       "allocator": "malloc" if args.libc_malloc else "pymalloc",
                        "instructions_per_event": per_event}, f, indent=2)
             f.write("\n")
         print(f"wrote {path}")
