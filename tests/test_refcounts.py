@@ -267,3 +267,17 @@ def test_input_wait_and_copy_rounds_leave_the_total_flat():
     totals = [int(x) for x in out.split()]
     assert len(totals) == 6
     assert totals[1:] == [totals[0]] * 5, totals
+
+
+@needs_debug
+def test_idle_ticker_sessions_leave_the_total_flat():
+    # Each round: start_trace with an idle period, a loop that runs freely for about a second
+    # (under sys.monitoring the idle calls come from the core's ticker thread), stop_trace,
+    # reset. After the first round every round must leave the total where it was.
+    out = subprocess.run([sys.executable, os.path.join(HERE, "refcount_idle_ticker.py"), "5"],
+                         capture_output=True, text=True, timeout=300, check=True).stdout
+    lines = out.split()
+    assert lines[-2] == "idle" and int(lines[-1]) >= 3, lines  # about one a round
+    totals = [int(x) for x in lines[:-2]]
+    assert len(totals) == 5
+    assert totals[1:] == [totals[0]] * 4, totals
