@@ -255,7 +255,7 @@ SPIN_IN_A_THREAD = """
     def work():
         shared.spin_window = [time.monotonic()]
         shared.tasks_while_running = len(os.listdir("/proc/self/task"))
-        spin(3.2)
+        spin(SECONDS)
         shared.spin_window.append(time.monotonic())
 
     worker = threading.Thread(target=work)
@@ -285,7 +285,9 @@ def test_idle_callback_runs_while_a_thread_runs_freely(tmp_path, idle_period):
     callback still runs about once a second during the spin, whichever source delivers the
     events (sys.monitoring sends none from places that went quiet: a native ticker brings
     them back while an idle period is set). After stop_trace no thread of the core is left."""
-    run = ok(run_traced(tmp_path, SPIN_IN_A_THREAD, first="continue_run",
+    seconds = 3.2 if idle_period > 0 else 0.5  # without an idle period nothing is awaited
+    program = SPIN_IN_A_THREAD.replace("SECONDS", str(seconds))
+    run = ok(run_traced(tmp_path, program, first="continue_run",
                         idle_period=idle_period, prelude=TASK_COUNTS,
                         idle_exec="shared.idle_times.append(time.monotonic())",
                         after_stop="[shared.spin_window, shared.idle_times, shared.tasks_before,"
