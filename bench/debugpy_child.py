@@ -5,7 +5,8 @@ the other modes).
 Usage: python debugpy_child.py ITERATIONS REPEATS [WORKLOAD,...]
 WORKLOAD is a key of run_bench.WORKLOADS (main, exc, gen, thr; default main).
 Prints one JSON line: {"times": [seconds, ...] (of main), "times_by_workload": {workload:
-[seconds, ...]}, "tracer": ...} or {"skip": reason}.
+[seconds, ...]}, "untraced_times_by_workload": {workload: [seconds, ...]} (the same
+workloads in this process before debugpy starts), "tracer": ...} or {"skip": reason}.
 
 The setting is the one a user of an editor has: debugpy listens on the loopback interface,
 a client (a second process started from here, speaking the Debug Adapter Protocol) attaches,
@@ -123,6 +124,11 @@ def run_program(iterations, repeats, workloads=("main",)):
         sys.path.insert(0, os.environ["BENCH_CALLGRIND_NULL_TRACER"])
         run_bench.use_callgrind_clock()
     line = run_bench.never_reached_line(workload.never_called)
+    # The same workloads untraced first, in this process: a process of its own lays out its
+    # heap and code differently, which moves wall times by a few percent either way, so
+    # debugpy's times are also read against this process's own untraced ones.
+    untraced = {kind: [run_bench.run_once_timed(iterations, run_bench.WORKLOADS[kind])
+                       for _ in range(repeats + 1)][1:] for kind in workloads}
     # The client process below is ours, not a program to debug: debugpy must not follow it.
     debugpy.configure(subProcess=False)
     host, port = debugpy.listen(("127.0.0.1", 0))
@@ -143,7 +149,8 @@ def run_program(iterations, repeats, workloads=("main",)):
             times = [run_bench.run_once_timed(iterations, work) for _ in range(repeats + 1)]
             by_workload[kind] = times[1:]
         return {"times": by_workload.get("main", []), "times_by_workload": by_workload,
-                "tracer": tracer, "debugpy": debugpy.__version__}
+                "untraced_times_by_workload": untraced, "tracer": tracer,
+                "debugpy": debugpy.__version__}
     finally:
         client.terminate()
         client.wait(timeout=10)

@@ -637,7 +637,8 @@ def count_events_in_c(n):
 
 def measure_debugpy(python, iterations, repeats, workloads=("main",)):
     """Runs debugpy_child.py under `python` (an interpreter that has debugpy); returns
-    {workload: list of times} and a note on how debugpy traced, or raises Skip."""
+    {workload: list of times}, a note on how debugpy traced and {workload: list of times}
+    of the same workloads untraced in debugpy's process, or raises Skip."""
     if not python:
         raise Skip("no --debugpy-python given")
     command = [python, os.path.join(HERE, "debugpy_child.py"), str(iterations), str(repeats),
@@ -655,7 +656,8 @@ def measure_debugpy(python, iterations, repeats, workloads=("main",)):
     if "skip" in result:
         raise Skip(result["skip"])
     times = result.get("times_by_workload") or {"main": result["times"]}
-    return times, f"debugpy {result['debugpy']} traced through {result['tracer']}"
+    untraced = result.get("untraced_times_by_workload", {})
+    return times, f"debugpy {result['debugpy']} traced through {result['tracer']}", untraced
 
 
 # ---- driver ---------------------------------------------------------------------------------
@@ -762,9 +764,13 @@ def print_table(rows, skipped, events, counts, c_counts, iterations, repeats):
         print(f"{row_label:<36}skipped: {reason}")
 
 
-def targets(rows):
-    """The issue's targets that this run's rows can tell: (what, figure, met or None)."""
+def targets(rows, debugpy_untraced=None):
+    """The issue's targets that this run's rows can tell: (what, figure, met or None).
+    debugpy_untraced: {debugpy mode: best time of its workload untraced in debugpy's own
+    process}; with it, each debugpy comparison is also made as the two slowdowns, each over
+    its own process's untraced time."""
     found = []
+    debugpy_untraced = debugpy_untraced or {}
 
     def best(row_label):
         return rows[row_label]["best_s"] if row_label in rows else None
@@ -787,6 +793,13 @@ def targets(rows):
                 found.append((f"{prefix}core-bp-unreached [{source}] at least as fast as "
                               f"{debugpy_mode}", f"{ours / theirs:.2f}x debugpy's time",
                               ours <= theirs))
+            ours_untraced = best(untraced_of(f"{prefix}core-bp-unreached"))
+            theirs_untraced = debugpy_untraced.get(debugpy_mode)
+            if ours is not None and ours_untraced and theirs_untraced:
+                slow_ours, slow_theirs = ours / ours_untraced, theirs / theirs_untraced
+                found.append(("  the same, each over its own process's untraced time",
+                              f"{slow_ours:.3f}x against debugpy's {slow_theirs:.3f}x",
+                              slow_ours <= slow_theirs))
     step_trace, step_mon = best(label("core-step-over", "settrace")), best(
         label("core-step-over", "monitoring"))
     if step_trace and step_mon:
@@ -848,13 +861,16 @@ def main(argv=None):
         return 1
     notes = {}
     debugpy_wanted = [m for m in wanted if m in DEBUGPY_MODES]
+    debugpy_untraced = {}
     if debugpy_wanted and not args.under_callgrind:
         try:
-            by_workload, notes["debugpy"] = measure_debugpy(
+            by_workload, notes["debugpy"], untraced_there = measure_debugpy(
                 args.debugpy_python, args.iterations, args.repeats,
                 [DEBUGPY_MODES[m] for m in debugpy_wanted])
             for mode in debugpy_wanted:
                 times[mode] = by_workload[DEBUGPY_MODES[mode]]
+                if untraced_there.get(DEBUGPY_MODES[mode]):
+                    debugpy_untraced[mode] = min(untraced_there[DEBUGPY_MODES[mode]])
         except Skip as exc:
             for mode in debugpy_wanted:
                 skipped[mode] = str(exc)
@@ -878,7 +894,12 @@ def main(argv=None):
                   "(aim: at most 2)")
     for mode, note in notes.items():
         print(f"{mode}: {note}")
-    found = targets(rows)
+    for mode, value in debugpy_untraced.items():
+        per_event = value / events_by_workload[workload_of(mode)] * 1e9
+        rows[mode]["untraced_in_own_process_ns_per_event"] = per_event
+        print(f"{mode}: the workload untraced in debugpy's process, before debugpy starts: "
+              f"{per_event:.1f} ns/event ({rows[mode]['best_s'] / value:.3f}x under debugpy)")
+    found = targets(rows, debugpy_untraced)
     if found:
         print("targets (wall time, best of the repeats):")
         for what, figure, met in found:
