@@ -277,3 +277,58 @@ def test_threads_stepping_while_the_core_is_reset_and_reinitialised(tmp_path):
                         count_only=True, cycle=cycle, timeout=100))
     assert run.stdout == "[(1, True), (2, True), (3, True)] True\n"
     assert run.stop_count > 100
+
+
+TICKER_STRESS = """
+    import random
+    import threading
+    import time
+    import tvantrel30pydebugstackless as core
+
+    def spin(flag):
+        n = 0
+        while not flag[0]:
+            n += 1
+
+    def toggle_idle(flag):
+        while not flag[0]:
+            core.set_idle_period(0.0)
+            time.sleep(0.001)
+            core.set_idle_period(0.05)
+            time.sleep(0.01)
+
+    stop = [False]
+    threads = [threading.Thread(target=spin, args=(stop,), name=f"spin{k}") for k in (1, 2)]
+    threads.append(threading.Thread(target=toggle_idle, args=(stop,), name="toggler"))
+    for t in threads:
+        t.start()
+    rng = random.Random(7)
+    deadline = time.monotonic() + 3.0
+    rounds = 0
+    while time.monotonic() < deadline:
+        choice = rng.randrange(3)
+        if choice == 0:
+            core.stop_trace()
+            core.start_trace()
+        elif choice == 1:
+            core.reset()
+            core.start_trace()
+        core.continue_run()
+        time.sleep(rng.uniform(0.0, 0.4))
+        rounds += 1
+    stop[0] = True
+    for t in threads:
+        t.join()
+    print("rounds", rounds > 5)
+"""
+
+
+def test_idle_ticker_while_sessions_restart_and_the_idle_period_toggles(tmp_path):
+    # Two threads spin freely; a third switches the idle period off and on every few
+    # milliseconds; main stops and restarts tracing or resets it at random moments. Under
+    # sys.monitoring each of these starts or ends the idle ticker, whose thread takes the
+    # interpreter lock twice a second; the run must end cleanly and the idle callback run.
+    run = ok(run_traced(tmp_path, TICKER_STRESS, first="continue_run", idle_period=0.05,
+                        timeout=100))
+    assert run.stdout == "rounds True\n"
+    assert ["idle"] in run.events
