@@ -22,9 +22,8 @@ constexpr auto kTickInterval = std::chrono::milliseconds(500);
 // are not any more, before a fork (a native thread would make os.fork warn that the process
 // is multi-threaded) and at exit. An ended thread is joined by whoever needs the record next
 // (it holds no lock by then: the join is immediate). The interpreter's threads change the
-// record with the interpreter lock held and take `lock` after it; the ticker takes `lock`
-// only while it does not hold the interpreter lock, or briefly after taking it: the order
-// is always interpreter lock first.
+// record with the interpreter lock held and take `lock` after it; the ticker never holds
+// `lock` while it takes or holds the interpreter lock, so the two cannot wait on each other.
 struct Ticker {
   std::mutex lock;
   std::condition_variable wake;
@@ -55,15 +54,11 @@ bool ticks_wanted() {
 }
 
 // With the interpreter lock: the next traced event reads the clock, and the places that went
-// quiet come back so that there is a next event.
-void tick(Ticker* t) {
+// quiet come back so that there is a next event. The tracer's own state, read under that
+// lock, says whether ticks are still wanted (the ticker's flags only follow it).
+void tick() {
   PyGILState_STATE gil = PyGILState_Ensure();
-  bool current;
-  {
-    std::lock_guard hold(t->lock);
-    current = t->wanted && !t->quit;
-  }
-  if (current && ticks_wanted()) {
+  if (ticks_wanted()) {
     gSelf.idle_tick = gSelf.idle_tick_limit;
     monitoring_lines_needed();
   }
@@ -78,7 +73,7 @@ void run_ticker(Ticker* t) {
     // makes a new thread, one before it finds this one running.
     if (t->quit || !t->wanted) break;
     hold.unlock();
-    tick(t);
+    tick();
     hold.lock();
   }
   t->running = false;
@@ -183,10 +178,4 @@ void init_idle_ticker() {
     PyErr_Clear();
   }
   saved.restore();
-}
-
-bool idle_ticker_running() {
-  Ticker* t = this_process_ticker();
-  std::lock_guard hold(t->lock);
-  return t->running;
 }

@@ -7,7 +7,7 @@
 // is above 0, a native thread (the ticker) wakes twice a second, takes the interpreter lock
 // and turns the quiet places on again, with the idle counter set so that the next traced
 // event reads the clock. The places go quiet again at their next event; the idle callback
-// keeps its cadence (the clock still decides when it runs). The thread sleeps while ticks
+// keeps its cadence (the clock still decides when it runs). The thread ends as soon as ticks
 // are not wanted; it is ended before os.fork (so that the program's fork sees no thread of
 // ours) and made again at the next traced event after it, and ended at exit.
 #pragma once
@@ -28,6 +28,3 @@ void idle_ticker_resume_after_fork();
 // interpreter lock once the interpreter finalises) and with os.register_at_fork (before; it
 // is made again after, in the parent, see above). Errors are logged and dropped.
 void init_idle_ticker();
-
-// Whether the ticker's thread exists (for the tests).
-bool idle_ticker_running();
