@@ -54,8 +54,7 @@ ensure_machine_packages() {
 }
 
 # Runs pip (its arguments), leaving out its notes about configured local package folders that
-# do not exist where it runs (the machine's pip configuration is shared with the unstable root,
-# where they are absent).
+# do not exist where it runs (a machine's configuration may name folders it does not have).
 pip_quietly() {  # python pip-args...
   local python="$1"
   shift
@@ -202,40 +201,63 @@ ensure_unstable_root() {
   root_is_complete "$root" || { root_fail "the new root in $root does not work"; return 1; }
 }
 
-# pip in the root reaches the same package index as here: the same configuration files, and
-# the certificate bundles they (or PIP_CERT) name, at the same paths. Also name resolution.
-copy_host_settings_into_root() {
-  local root="$UNSTABLE_ROOT" f cert
-  local files=(/etc/resolv.conf /etc/hosts /etc/pip.conf /etc/xdg/pip/pip.conf
-               "$HOME/.config/pip/pip.conf" "$HOME/.pip/pip.conf")
-  local certs=()
-  [ -n "${PIP_CERT:-}" ] && certs+=("$PIP_CERT")
-  for f in "${files[@]}"; do
-    [ -f "$f" ] || continue
-    as_root mkdir -p "$root$(dirname "$f")"
-    as_root cp -L "$f" "$root$f"
-    case "$f" in
-      *pip.conf) while read -r cert; do certs+=("$cert"); done \
-                   < <(sed -n 's/^[ \t]*cert[ \t]*=[ \t]*//p' "$f") ;;
-    esac
+# pip inside the root: its own configuration, written from this machine's settings.
+#
+# Two ways were possible: copy the machine's pip configuration files and every local file or
+# folder they (or the PIP_* variables) name, or give the root's pip a configuration of its
+# own. The second is taken: a configuration can name anything local (constraints,
+# requirements, find-links folders, file:// indexes, several GB on some machines), and its
+# owner changes it at will, so copying would chase every new kind of setting. The root's pip
+# gets only what reaching the package index takes (index URLs, trusted hosts, proxy,
+# time-outs, and the certificate bundles, copied into the root); tools/root_pip_conf.py
+# reads the machine's settings through pip itself and writes it. in_root runs every command
+# with PIP_CONFIG_FILE naming it and without this machine's PIP_* variables; configuration
+# files left in the root by older versions of this script are removed, since pip would
+# still read them.
+ROOT_PIP_DIR=/etc/selvane/pip
+
+write_root_pip_config() {  # dir-in-root: writes DIR/pip.conf (and certificates) in the root
+  local dir="$1" python
+  python="$(python_for "${TARGET_VERSIONS[0]}")"
+  [ -x "$python" ] || python=python3
+  as_root "$python" "$ROOT/tools/root_pip_conf.py" "$UNSTABLE_ROOT$dir" "$dir"
+}
+
+write_root_settings() {
+  local root="$UNSTABLE_ROOT" f
+  for f in /etc/resolv.conf /etc/hosts; do
+    [ -f "$f" ] && as_root cp -L "$f" "$root$f"
   done
-  for cert in "${certs[@]}"; do
-    [ -f "$cert" ] || continue
-    as_root mkdir -p "$root$(dirname "$cert")"
-    as_root cp -L "$cert" "$root$cert"
-  done
+  as_root rm -rf "$root/etc/pip.conf" "$root/etc/xdg/pip" "$root/root/.pip" \
+    "$root/root/.config/pip"
+  write_root_pip_config "$ROOT_PIP_DIR"
 }
 
 # Runs a command inside the root, in a mount namespace of its own: /proc, /dev and a fresh
 # /tmp are mounted there and vanish with the command, whatever way it ends. The environment
-# keeps this machine's variables (pip's settings among them) with a plain PATH.
+# keeps this machine's variables with a plain PATH, except pip's: the root's pip reads only
+# the configuration written for it (write_root_settings).
 in_root() {
+  local drop=() v
+  for v in $(compgen -e); do
+    case "$v" in PIP_* | XDG_CONFIG_*) drop+=(-u "$v") ;; esac
+  done
+  # pip (from 24.2) verifies the index's certificate through the system's trust store, that
+  # is OpenSSL's default bundle (SSL_CERT_FILE), not through its own `cert` setting: where
+  # this machine reaches the index through an authority of its own, the root must trust the
+  # bundle copied for pip as well.
+  local trust=()
+  if [ -f "$UNSTABLE_ROOT$ROOT_PIP_DIR/cert.pem" ]; then
+    trust=(SSL_CERT_FILE="$ROOT_PIP_DIR/cert.pem" REQUESTS_CA_BUNDLE="$ROOT_PIP_DIR/cert.pem")
+  fi
   as_root unshare --mount --propagation private -- /bin/sh -c '
     root="$1"; shift
     mount -t proc proc "$root/proc" && mount --rbind /dev "$root/dev" &&
       mount -t tmpfs tmpfs "$root/tmp" || exit 1
-    exec chroot "$root" /usr/bin/env PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin "$@"
-  ' in_root "$UNSTABLE_ROOT" "$@"
+    exec chroot "$root" /usr/bin/env "$@"
+  ' in_root "$UNSTABLE_ROOT" "${drop[@]}" \
+    PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin \
+    PIP_CONFIG_FILE="$ROOT_PIP_DIR/pip.conf" "${trust[@]}" "$@"
 }
 
 # This checkout's workspace inside the root (a path as seen from inside it), one per
