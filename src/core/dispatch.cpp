@@ -454,9 +454,34 @@ int dispatch_call(ThreadData* data, PyObject* frame) {
   return 0;
 }
 
+namespace {
+
+// The exception value of a record: the second item of the event's argument.
+PyObject* recorded_value(PyObject* recorded) {
+  return PyTuple_Check(recorded) && PyTuple_GET_SIZE(recorded) > 1 ? PyTuple_GET_ITEM(recorded, 1)
+                                                                   : nullptr;
+}
+
+// A frame on a line of its own is done with the exception recorded for it, unless it is
+// still handling that very exception (an except, finally or with-exit block, which may yet
+// raise it again). The trace function reports no handling: this is where a caught
+// exception's record goes, so that it keeps nothing alive past the handler's end.
+void forget_exception_left_behind(PyObject* frame) {
+  if (!gSelf.exc_data.frame_exc_info) return;
+  PyObject* recorded = find_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame);
+  if (recorded == nullptr) return;
+  Ref handled = Ref::steal(PyErr_GetHandledException());
+  if (handled && handled.get() == recorded_value(recorded)) return;
+  enter_debugger();  // dropping the record can run finalizers
+  forget_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame);
+}
+
+}  // namespace
+
 int dispatch_line(ThreadData* data, PyObject* frame) {
   if (!gSelf.trace_started) return -1;
   if (!compat::is_plain_frame(frame)) return 0;
+  forget_exception_left_behind(frame);
   if (dprintf_wanted(kDbgFlow)) {
     const char* path = __tracer_get_full_path(&gSelf.co_pathname_table, frame);
     if (path == nullptr) PyErr_Clear();
