@@ -12,7 +12,9 @@ import sys
 
 import pytest
 
-from conftest import TIMEOUT, write_program
+from conftest import TIMEOUT, ok, run_traced, write_program
+
+FREE = dict(first="continue_run", default="continue_run", when_elsewhere="continue_run")
 
 
 def run_debugged(tmp_path, program, *options, timeout=TIMEOUT):
@@ -198,4 +200,39 @@ def test_an_exception_unwinding_20000_frames_costs_per_frame_what_500_frames_cos
     # and a few times what it costs untraced.
     assert deep < 4 * shallow, (shallow, deep)
     assert deep < 20 * max(untraced_deep, untraced_shallow), (deep, untraced_deep)
+
+
+def test_a_stop_at_the_recursion_limit_of_c_calls_keeps_the_debugger(tmp_path):
+    # Comparisons that recurse through C until the interpreter gives up, caught by a context
+    # manager (which the analysis cannot see through): the stop's callback runs where the
+    # program has no call left, and must neither fail (the interpreter would print an
+    # unraisable RecursionError and tracing would end) nor change what the program sees.
+    source = """
+        import contextlib
+
+        class Node:
+            def __init__(self):
+                self.other = self
+
+            def __eq__(self, other):
+                return self.other == other.other
+
+        def compare():
+            with contextlib.suppress(RecursionError):
+                Node() == Node()
+            return "compared"
+
+        print(compare())
+        with contextlib.suppress(KeyError):
+            raise KeyError("after")
+        print("still traced")
+        """
+    plain = run_untraced(tmp_path, write_program(tmp_path, source))
+    run = ok(run_traced(tmp_path, source, exception_mode=2, **FREE))
+    assert "Exception ignored" not in run.stderr, run.stderr
+    assert run.stdout == plain.stdout == "compared\nstill traced\n"
+    # Both exceptions stop (the analysis sees no handler): the second one only while the
+    # thread is still traced after the first.
+    kinds = [s[4] for s in run.stops if s[0] == "exception"]
+    assert kinds[:1] == ["RecursionError"] and kinds[-1:] == ["KeyError"], run.stops
 

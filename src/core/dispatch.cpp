@@ -134,6 +134,10 @@ int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int wha
               bool monitoring) {
   bool stopped = false;
   bool propagate = false;
+  // The event may come at the program's recursion limit, where the program may even be
+  // raising RecursionError: the core's Python calls (callbacks, hooks, the attributes its
+  // decisions read) must not fail there, which would also switch tracing off for the thread.
+  compat::RecursionRoom room(kCoreRecursionRoom);
   if (!__ensure_tracer_status(ts, data)) {
     do_dprintf(kDbgFlow, "TRACER STOPPED WHILE WAITING FOR MUTEX\n");
   } else {
@@ -567,6 +571,7 @@ int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
 int do_callback(PyObject* cb, PyObject* frame, PyObject* arg) {
   enter_debugger();
   if (cb == nullptr) return 0;
+  compat::RecursionRoom room(kCoreRecursionRoom);
   Ref changed = Ref::steal(__tracer_get_changed_bps_lists(&gSelf.bp_ops_data));
   if (!changed) return -1;
   Ref result = Ref::steal(arg == nullptr ? do_two_arg_call(cb, frame, changed.get())
