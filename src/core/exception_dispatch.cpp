@@ -137,8 +137,10 @@ int dispatch_exception(PyObject* frame, PyObject* exc_arg) {
       return -1;
     }
   }
-  // Whether or not it stopped: the frame's return event needs to know the exception.
-  if (set_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame, exc_arg) != 0) {
+  // Whether or not it stopped: the frame's return event needs to know the exception. (Not
+  // once the callback stopped tracing: no event would come to drop the record.)
+  if (gSelf.trace_started &&
+      set_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame, exc_arg) != 0) {
     do_dprintf(kDbgFlow, "  set_frame_exc_info failed\n");
     PyErr_Clear();
   }
