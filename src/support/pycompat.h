@@ -161,6 +161,15 @@ inline bool use_tracing_set(PyThreadState* ts, int value) noexcept {
   return true;
 }
 
+// ---- Builtin functions ---------------------------------------------------------------------
+
+// The method definition behind a builtin function or method object, or null for any other
+// object. Borrowed: it lives as long as the method table it comes from.
+inline PyMethodDef* method_def_of(PyObject* function) noexcept {
+  if (!PyCFunction_Check(function)) return nullptr;
+  return reinterpret_cast<PyCFunctionObject*>(function)->m_ml;
+}
+
 // ---- Recursion room ----------------------------------------------------------------------
 
 // How many more nested calls the thread may make before the interpreter raises RecursionError

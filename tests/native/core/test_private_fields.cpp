@@ -228,4 +228,18 @@ TEST_F(PrivateFieldTest, RecursionRoomLetsNestedCallsRunAtTheLimitAndGivesItBack
   EXPECT_EQ(PyErr_Occurred(), nullptr);
 }
 
+TEST_F(PrivateFieldTest, MethodDefinitionIsTheBuiltinFunctionsOwn) {
+  Ref builtins = Ref::steal(PyImport_ImportModule("builtins"));
+  ASSERT_TRUE(builtins);
+  Ref len = Ref::steal(PyObject_GetAttrString(builtins.get(), "len"));
+  ASSERT_TRUE(len);
+  PyMethodDef* def = compat::method_def_of(len.get());
+  ASSERT_NE(def, nullptr);
+  EXPECT_STREQ(def->ml_name, "len");
+  Ref again = Ref::steal(PyCFunction_NewEx(def, builtins.get(), nullptr));
+  ASSERT_TRUE(again);
+  EXPECT_EQ(PyObject_RichCompareBool(again.get(), len.get(), Py_EQ), 1);
+  EXPECT_EQ(compat::method_def_of(builtins.get()), nullptr);
+}
+
 }  // namespace
