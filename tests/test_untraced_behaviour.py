@@ -7,6 +7,7 @@ Each program runs twice in a subprocess with a timeout: untraced, and under
 inside one run by ratio, so that a loaded machine slows both sides alike.
 """
 
+import os
 import subprocess
 import sys
 
@@ -267,3 +268,23 @@ def test_stopping_the_trace_in_a_handler_keeps_nothing_alive(tmp_path):
                         probe="core.stop_trace()", **FREE))
     assert [s[3] for s in run.stops] == ["inner"]
     assert run.stdout == "freed\n"
+
+
+def test_a_file_outside_the_working_directory_is_shown_by_its_absolute_path(tmp_path):
+    outside = tmp_path / "outside"
+    work = tmp_path / "deep" / "er" / "work"
+    outside.mkdir()
+    work.mkdir(parents=True)
+    program = outside / "prog.py"
+    program.write_text("x = 1\nprint(x)\n")
+    inside = work / "here.py"
+    inside.write_text("y = 2\n")
+    args = [sys.executable, "-m", "selvane", "--no-stop-at-start",
+            "--break", f"{program}:2", "--break", "here.py:1", str(program)]
+    run = subprocess.run(args, stdin=subprocess.DEVNULL, capture_output=True, text=True,
+                         timeout=TIMEOUT, cwd=str(work))
+    out = run.stdout + run.stderr
+    assert f"Breakpoint 1 at {program}:2" in out, out
+    assert "Breakpoint 2 at here.py:1" in out, out
+    assert f"{program}:2" in out.split("Breakpoint 2", 1)[1], out
+    assert ".." + os.sep not in out, out
