@@ -36,20 +36,19 @@ PyObject* builtins_for_hook() {
 // error set.
 Ref hook_of_the_builtins(PyObject* method, PyObject* module_name) {
   PyMethodDef* def = compat::method_def_of(method);
-  if (def == nullptr) {
-    PyErr_SetString(PyExc_TypeError, "the module's __import__ is not a builtin function");
-    return Ref();
-  }
+  if (def == nullptr) return Ref::borrow(method);  // a stand-in of an embedding: as it is
   Ref builtins = Ref::steal(PyImport_ImportModule("builtins"));
   if (!builtins) return Ref();
   return Ref::steal(PyCFunction_NewEx(def, builtins.get(), module_name));
 }
 
-// Whether `candidate` (the default import given to init) is the replacement itself, in any
+// 1 when `candidate` (the default import given to init) is the replacement itself, in any
 // of its forms (the module's method, a hook installed before): it would call itself forever.
-bool is_our_import(PyObject* method, PyObject* candidate) {
-  PyMethodDef* def = compat::method_def_of(candidate);
-  return def != nullptr && def == compat::method_def_of(method);
+// -1 with the error set.
+int is_our_import(PyObject* method, PyObject* candidate) {
+  PyMethodDef* def = compat::method_def_of(method);
+  if (def == nullptr) return PyObject_RichCompareBool(method, candidate, Py_EQ);
+  return compat::method_def_of(candidate) == def ? 1 : 0;
 }
 
 // Nothing the hook does after the import is traced: the thread's tracing counter is raised
@@ -136,7 +135,9 @@ void __tracer_install_import_hook() {
   }
   Ref hook = hook_of_the_builtins(method.get(), module_name.get());
   if (!hook) return;
-  if (s.default_import && is_our_import(method.get(), s.default_import.get())) {
+  int same = s.default_import ? is_our_import(method.get(), s.default_import.get()) : 0;
+  if (same < 0) return;
+  if (same) {
     PyErr_SetString(PyExc_AssertionError,
                     "The default import hook cannot be equal to our import hook");
     return;
