@@ -89,7 +89,7 @@ def main(argv=None):
 
     from .console import Console, Terminal
     from .runner import Program, ProgramError, run
-    from .session import Session, SessionError, load_sub_language_hook
+    from .session import Session, SessionError, _show_path, load_sub_language_hook
 
     program = Program(target[1], program_args, is_module=target[0] == "module")
     try:
@@ -118,7 +118,7 @@ def main(argv=None):
         except SessionError as error:
             print(f"python -m selvane: --break {location}: {error}", file=sys.stderr)
             return 2
-        console.say(f"Breakpoint {bp.number} at {os.path.relpath(bp.file)}:{bp.line}")
+        console.say(f"Breakpoint {bp.number} at {_show_path(bp.file)}:{bp.line}")
 
     def on_start():
         session.program_started()

@@ -1013,11 +1013,15 @@ def _one_line(error):
 
 
 def _show_path(path):
+    """A path as the person reads it: relative to the working directory when the file is
+    under it, else absolute (never a climb of "../" up to the root)."""
     try:
         relative = os.path.relpath(path)
     except ValueError:
-        return path
-    return relative if not relative.startswith("..") else path
+        return os.path.abspath(path)
+    if relative == os.pardir or relative.startswith(os.pardir + os.sep):
+        return os.path.abspath(path)
+    return relative
 
 
 def _exit_now():

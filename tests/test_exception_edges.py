@@ -434,9 +434,8 @@ def test_class_expression_that_raises_in_the_analysis_counts_as_not_matching(tmp
 
 # ---- recursion headroom ------------------------------------------------------------------------
 
-HEADROOM = """
-    class MyRuntimeError(RuntimeError):
-        pass
+ROOM = """
+    import sys
 
     def raise_it(exc):
         try:
@@ -444,24 +443,39 @@ HEADROOM = """
         except BaseException:
             pass
 
+    def at_depth(left, exc):
+        # Calls down until `left` frames remain below the limit, then raises there.
+        def down():
+            try:
+                down()
+            except RecursionError:
+                raise_it(exc)
+        try:
+            down()
+        except RecursionError:
+            pass
+
     raise_it(RuntimeError("maximum recursion depth exceeded (made up)"))
-    raise_it(MyRuntimeError("maximum recursion depth exceeded in a subclass"))
-    raise_it(RuntimeError("the maximum recursion depth exceeded"))
-    raise_it(ValueError("maximum recursion depth exceeded"))
-    raise_it(RuntimeError(42))
-    raise_it(RuntimeError())
+    raise_it(ValueError("shallow"))
+    at_depth(0, ValueError("at the limit"))
+    at_depth(0, KeyError("at the limit"))
+    print("limit", sys.getrecursionlimit())
 """
 
 
-def test_recursion_headroom_only_for_the_recursion_message_of_a_runtime_error(tmp_path):
-    run = ok(run_traced(tmp_path, HEADROOM, exception_mode=1, probe="sys.getrecursionlimit()",
-                        after_stop="sys.getrecursionlimit()", **FREE))
-    limit = run.after_stop
-    assert [s[4:] for s in exception_stops(run)] == [
-        ("RuntimeError", limit + 50),
-        ("MyRuntimeError", limit + 50),
-        ("RuntimeError", limit),
-        ("ValueError", limit),
-        ("RuntimeError", limit),
-        ("RuntimeError", limit),
+def test_room_for_the_core_follows_the_depth_not_the_exception(tmp_path):
+    # Whatever the exception, a stop near the recursion limit leaves its callback room to nest
+    # calls; and nowhere does the program or the callback see another recursion limit.
+    probe = ("[sys.getrecursionlimit(), "
+             "(lambda f: f(f, 20))(lambda f, n: n == 0 or bool(f(f, n - 1)))]")
+    run = ok(run_traced(tmp_path, ROOM, exception_mode=1, probe=probe, **FREE))
+    limit = sys.getrecursionlimit()
+    stops = [(s[4], s[-1]) for s in exception_stops(run) if s[3] == "raise_it"]
+    assert stops == [
+        ("RuntimeError", [limit, True]),
+        ("ValueError", [limit, True]),
+        ("ValueError", [limit, True]),
+        ("KeyError", [limit, True]),
     ]
+    assert run.stdout == f"limit {limit}\n"
+    same_outcome(tmp_path, run, ROOM)

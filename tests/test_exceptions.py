@@ -213,7 +213,13 @@ def test_exception_leaving_the_bottom_frame_stops_even_in_never_mode(tmp_path, a
 
 # ---- recursion depth ---------------------------------------------------------------------------
 
-def test_recursion_error_gets_headroom_for_the_callback(tmp_path):
+# What a stop's callback can still do, as a probe: nest 20 calls (as the server side's own
+# code does), and read the recursion limit.
+ROOM_PROBE = ("[sys.getrecursionlimit(), "
+              "(lambda f: f(f, 20))(lambda f, n: n == 0 or bool(f(f, n - 1)))]")
+
+
+def test_recursion_error_stop_has_room_for_the_callback(tmp_path):
     program = """
         import sys
 
@@ -227,12 +233,13 @@ def test_recursion_error_gets_headroom_for_the_callback(tmp_path):
             pass
         print(sys.getrecursionlimit() == before)
     """
-    run = ok(run_traced(tmp_path, program, exception_mode=1, max_stops=1,
-                        probe="sys.getrecursionlimit()", **FREE))
+    run = ok(run_traced(tmp_path, program, exception_mode=1, max_stops=1, probe=ROOM_PROBE,
+                        **FREE))
     assert run.stdout == "True\n"
     first = exception_stops(run)[0]
     assert first[4] == "RecursionError"
-    assert first[-1] == sys.getrecursionlimit() + 50
+    # The callback nests its calls at the limit, and the limit is the program's own.
+    assert first[-1] == [sys.getrecursionlimit(), True]
 
 
 # ---- the catch-info list (modes 4 and 5) ------------------------------------------------------

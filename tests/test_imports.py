@@ -402,6 +402,13 @@ def test_each_import_statement_is_one_call_of_the_hook(tmp_path):
 # ---- in this process: the hook itself, register_module, set_import_cb ------------------------
 
 
+def is_the_hook(function):
+    """The core's replacement __import__ as it goes into the builtins: the module's method,
+    shown as a function of the builtins module."""
+    return (type(function) is type(core.__import__) and function.__name__ == "__import__"
+            and function.__self__ is builtins and function is not ORIGINAL_IMPORT)
+
+
 @pytest.fixture
 def initialised():
     core.init(*init_args())
@@ -422,11 +429,27 @@ def test_method_docstrings():
 
 
 def test_init_puts_the_hook_into_the_builtins(initialised):
-    assert builtins.__import__ == core.__import__
-    assert builtins.__import__ is not ORIGINAL_IMPORT
+    hook = builtins.__import__
+    assert hook is not ORIGINAL_IMPORT
+    assert hook.__name__ == core.__import__.__name__ == "__import__"
     assert core.__import__.__module__ == "builtins"
+    # Shown as the builtins module's own function, as the interpreter's __import__ is.
+    assert hook.__self__ is builtins is ORIGINAL_IMPORT.__self__
+    assert hook.__module__ == ORIGINAL_IMPORT.__module__ == "builtins"
+    calls = core.get_new_imports()
+    assert hook("json") is __import__("json")
+    del calls
     import json  # noqa: F401 -- an import statement goes through it
     assert core.__import__("os") is os
+
+
+def test_the_hook_has_the_interpreters_signature_and_no_docstring(initialised):
+    import inspect
+    expected = "(name, globals=None, locals=None, fromlist=(), level=0)"
+    assert str(inspect.signature(ORIGINAL_IMPORT)) == expected
+    for hook in (builtins.__import__, core.__import__):
+        assert str(inspect.signature(hook)) == expected
+        assert hook.__doc__ is None
 
 
 def test_the_hook_takes_keywords(initialised):
@@ -449,7 +472,7 @@ def test_init_refuses_our_own_hook_as_the_default_import(initialised):
                        match="^The default import hook cannot be equal to our import hook$"):
         core.init(*init_args(default_import=builtins.__import__))
     core.init(*init_args())
-    assert builtins.__import__ == core.__import__
+    assert is_the_hook(builtins.__import__)
 
 
 def test_the_hook_goes_into_the_builtins_the_initialising_code_sees():
@@ -458,12 +481,12 @@ def test_the_hook_goes_into_the_builtins_the_initialising_code_sees():
     builtins.__import__ = ORIGINAL_IMPORT
     try:
         exec("core.init(*args)", {"__builtins__": own, "core": core, "args": init_args()})
-        assert own["__import__"] == core.__import__
+        assert is_the_hook(own["__import__"])
         assert builtins.__import__ is ORIGINAL_IMPORT
     finally:
         core.init(*init_args())
         core.reset()
-    assert builtins.__import__ == core.__import__
+    assert is_the_hook(builtins.__import__)
 
 
 def test_register_module_answers_the_full_path_and_calls_the_callback(initialised, tmp_path,
@@ -579,7 +602,7 @@ def test_the_hook_goes_into_the_builtins_module_when_no_frame_runs():
         deadline = time.monotonic() + 10
         while builtins.__import__ is ORIGINAL_IMPORT and time.monotonic() < deadline:
             time.sleep(0.005)
-        assert builtins.__import__ == core.__import__
+        assert is_the_hook(builtins.__import__)
     finally:
         core.init(*init_args())
         core.reset()

@@ -1,5 +1,6 @@
 """The module's method table: every method, in its documented order, with its docstring,
-and how each is called (keywords only for __import__).
+and how each is called (keywords only for __import__, which has no docstring but the
+interpreter's signature).
 
 The table is part of the contract with the server side: a server written against it finds
 each method by name and reads its documentation as it stands, including the docstring that
@@ -115,3 +116,13 @@ def test_only_the_import_hook_takes_keywords():
 
 def test_the_module_has_no_docstring():
     assert core.__doc__ is None
+
+
+def test_the_import_hook_has_no_docstring_but_the_interpreters_signature():
+    import builtins
+    import inspect
+
+    from core_args import ORIGINAL_IMPORT
+    assert core.__import__.__doc__ is None
+    assert str(inspect.signature(core.__import__)) == str(inspect.signature(ORIGINAL_IMPORT))
+    assert ORIGINAL_IMPORT.__self__ is builtins

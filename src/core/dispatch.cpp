@@ -134,6 +134,10 @@ int run_event(PyThreadState* ts, ThreadData* data, PyFrameObject* frame, int wha
               bool monitoring) {
   bool stopped = false;
   bool propagate = false;
+  // The event may come at the program's recursion limit, where the program may even be
+  // raising RecursionError: the core's Python calls (callbacks, hooks, the attributes its
+  // decisions read) must not fail there, which would also switch tracing off for the thread.
+  compat::RecursionRoom room(kCoreRecursionRoom);
   if (!__ensure_tracer_status(ts, data)) {
     do_dprintf(kDbgFlow, "TRACER STOPPED WHILE WAITING FOR MUTEX\n");
   } else {
@@ -454,9 +458,34 @@ int dispatch_call(ThreadData* data, PyObject* frame) {
   return 0;
 }
 
+namespace {
+
+// The exception value of a record: the second item of the event's argument.
+PyObject* recorded_value(PyObject* recorded) {
+  return PyTuple_Check(recorded) && PyTuple_GET_SIZE(recorded) > 1 ? PyTuple_GET_ITEM(recorded, 1)
+                                                                   : nullptr;
+}
+
+// A frame on a line of its own is done with the exception recorded for it, unless it is
+// still handling that very exception (an except, finally or with-exit block, which may yet
+// raise it again). The trace function reports no handling: this is where a caught
+// exception's record goes, so that it keeps nothing alive past the handler's end.
+void forget_exception_left_behind(PyObject* frame) {
+  if (!gSelf.exc_data.frame_exc_info) return;
+  PyObject* recorded = find_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame);
+  if (recorded == nullptr) return;
+  Ref handled = Ref::steal(PyErr_GetHandledException());
+  if (handled && handled.get() == recorded_value(recorded)) return;
+  enter_debugger();  // dropping the record can run finalizers
+  forget_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame);
+}
+
+}  // namespace
+
 int dispatch_line(ThreadData* data, PyObject* frame) {
   if (!gSelf.trace_started) return -1;
   if (!compat::is_plain_frame(frame)) return 0;
+  forget_exception_left_behind(frame);
   if (dprintf_wanted(kDbgFlow)) {
     const char* path = __tracer_get_full_path(&gSelf.co_pathname_table, frame);
     if (path == nullptr) PyErr_Clear();
@@ -542,6 +571,7 @@ int dispatch_return(ThreadData* data, PyObject* frame, PyObject* retval) {
 int do_callback(PyObject* cb, PyObject* frame, PyObject* arg) {
   enter_debugger();
   if (cb == nullptr) return 0;
+  compat::RecursionRoom room(kCoreRecursionRoom);
   Ref changed = Ref::steal(__tracer_get_changed_bps_lists(&gSelf.bp_ops_data));
   if (!changed) return -1;
   Ref result = Ref::steal(arg == nullptr ? do_two_arg_call(cb, frame, changed.get())

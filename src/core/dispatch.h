@@ -32,6 +32,10 @@ struct DispatchEvent {
   int tracing_at_entry;  // the thread's tracing counter when it entered the debugger
 };
 
+// The nested calls the core's own work may make beyond the program's recursion limit (see
+// compat::RecursionRoom): an event is handled with at least this many left.
+constexpr int kCoreRecursionRoom = 50;
+
 int do_callback(PyObject* cb, PyObject* frame, PyObject* arg);
 int do_idle();
 

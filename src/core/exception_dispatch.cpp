@@ -21,8 +21,6 @@
 
 namespace {
 
-constexpr int kRecursionHeadroom = 50;
-
 bool matches_list(PyObject* exc_type, const Ref& list) {
   return list && PyErr_GivenExceptionMatches(exc_type, list.get());
 }
@@ -111,26 +109,6 @@ bool filtered(const ReportedPlace& place, PyObject* inner) {
   return __tracer_exc_filtered_hack(place.file, line) != 0;
 }
 
-// A recursion-depth error: the server side's own code needs some room to run at that depth.
-// The message is read from the exception instance (its first argument when that is a str).
-bool is_recursion_depth_error(PyObject* exc_arg) {
-  PyObject* type = PyTuple_GET_ITEM(exc_arg, 0);
-  if (type == Py_None || !PyErr_GivenExceptionMatches(type, PyExc_RuntimeError)) return false;
-  PyObject* value = value_of(exc_arg);
-  PyObject* message = value;
-  if (PyExceptionInstance_Check(value)) {
-    PyObject* args = reinterpret_cast<PyBaseExceptionObject*>(value)->args;
-    message = args != nullptr && PyTuple_Check(args) && PyTuple_GET_SIZE(args) > 0
-                  ? PyTuple_GET_ITEM(args, 0)
-                  : nullptr;
-  }
-  static constexpr char kPrefix[] = "maximum recursion depth exceeded";
-  const char* text = message != nullptr && PyUnicode_CheckExact(message)
-                         ? _pystring_to_c_string(message)
-                         : nullptr;
-  return text != nullptr && std::strncmp(text, kPrefix, sizeof kPrefix - 1) == 0;
-}
-
 // The exception being handled now, as an event argument: (type, value, traceback).
 Ref handled_exception_arg() {
   Ref value = Ref::steal(PyErr_GetHandledException());
@@ -159,8 +137,10 @@ int dispatch_exception(PyObject* frame, PyObject* exc_arg) {
       return -1;
     }
   }
-  // Whether or not it stopped: the frame's return event needs to know the exception.
-  if (set_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame, exc_arg) != 0) {
+  // Whether or not it stopped: the frame's return event needs to know the exception. (Not
+  // once the callback stopped tracing: no event would come to drop the record.)
+  if (gSelf.trace_started &&
+      set_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame, exc_arg) != 0) {
     do_dprintf(kDbgFlow, "  set_frame_exc_info failed\n");
     PyErr_Clear();
   }
@@ -220,11 +200,7 @@ int do_exception_callback_if_not_filtered(PyObject* frame, PyObject* exc_arg) {
     return 0;
   }
   if (filtered(place, inner.get())) return 0;
-  int old_limit = Py_GetRecursionLimit();
-  bool raised = is_recursion_depth_error(exc_arg);
-  if (raised) Py_SetRecursionLimit(old_limit + kRecursionHeadroom);
   int result = do_callback(gSelf.exception_cb.get(), frame, exc_arg);
-  if (raised) Py_SetRecursionLimit(old_limit);
   return result != 0 ? -1 : 0;
 }
 

@@ -30,6 +30,27 @@ PyObject* builtins_for_hook() {
   return PyEval_GetBuiltins();
 }
 
+// The function placed into the builtins: the module's __import__, shown as the builtins
+// module's own function (its __self__ and __module__), as the interpreter's __import__ is. A
+// program that inspects it sees what it would see untraced. New reference, or null with the
+// error set.
+Ref hook_of_the_builtins(PyObject* method, PyObject* module_name) {
+  PyMethodDef* def = compat::method_def_of(method);
+  if (def == nullptr) return Ref::borrow(method);  // a stand-in of an embedding: as it is
+  Ref builtins = Ref::steal(PyImport_ImportModule("builtins"));
+  if (!builtins) return Ref();
+  return Ref::steal(PyCFunction_NewEx(def, builtins.get(), module_name));
+}
+
+// 1 when `candidate` (the default import given to init) is the replacement itself, in any
+// of its forms (the module's method, a hook installed before): it would call itself forever.
+// -1 with the error set.
+int is_our_import(PyObject* method, PyObject* candidate) {
+  PyMethodDef* def = compat::method_def_of(method);
+  if (def == nullptr) return PyObject_RichCompareBool(method, candidate, Py_EQ);
+  return compat::method_def_of(candidate) == def ? 1 : 0;
+}
+
 // Nothing the hook does after the import is traced: the thread's tracing counter is raised
 // for the scope.
 class UntracedScope {
@@ -106,14 +127,15 @@ void __tracer_install_import_hook() {
     do_dprintf(kDbgFlow, "NOT INSTALLING TRACE HOOK\n");
     return;
   }
-  Ref hook = Ref::steal(PyObject_GetAttrString(s.module.get(), "__import__"));
-  if (!hook) return;
+  Ref method = Ref::steal(PyObject_GetAttrString(s.module.get(), "__import__"));
+  if (!method) return;
   Ref module_name = Ref::steal(gPtrTo_PyUnicode_FromString("builtins"));
-  if (!module_name || PyObject_SetAttrString(hook.get(), "__module__", module_name.get()) != 0) {
+  if (!module_name || PyObject_SetAttrString(method.get(), "__module__", module_name.get()) != 0) {
     return;
   }
-  int same =
-      s.default_import ? PyObject_RichCompareBool(hook.get(), s.default_import.get(), Py_EQ) : 0;
+  Ref hook = hook_of_the_builtins(method.get(), module_name.get());
+  if (!hook) return;
+  int same = s.default_import ? is_our_import(method.get(), s.default_import.get()) : 0;
   if (same < 0) return;
   if (same) {
     PyErr_SetString(PyExc_AssertionError,

@@ -245,6 +245,9 @@ void __tracer_stop_trace() {
   if (monitoring_in_force()) monitoring_stop();
   install_start_thread_hooks(0);
   idle_ticker_update();
+  // No event will come to drop them: the records would keep their exceptions, frames and
+  // locals alive for the rest of the program.
+  gSelf.exc_data.frame_exc_info.reset();
 }
 
 namespace {

@@ -27,7 +27,7 @@ namespace {
 
 constexpr const char* kToolName = "selvane";
 
-constexpr size_t kCallbackCount = 10;  // the events of gCallbacks below
+constexpr size_t kCallbackCount = 11;  // the events of gCallbacks below
 
 struct MonitoringTool {
   Ref monitoring;                  // sys.monitoring while the tool is in use
@@ -60,8 +60,47 @@ PyObject* on_throw(PyObject*, PyObject* const*, Py_ssize_t) {
   return deliver(PyTrace_CALL, nullptr);
 }
 
-PyObject* on_unwind(PyObject*, PyObject* const*, Py_ssize_t) {
-  return deliver(PyTrace_RETURN, nullptr);  // left by an exception: no value
+// ---- Exception records ------------------------------------------------------------------------
+//
+// A frame's record lives while its exception is in flight there (exceptops.h): RAISE makes
+// it, and each of the events below ends it, so none outlives what the interpreter keeps.
+
+// The trace function's exception argument: (type, value, traceback); null with no error when
+// there is no memory for it.
+Ref exception_arg(PyObject* exc) {
+  PyObject* tb = PyException_GetTraceback(exc);  // new reference or null
+  Ref traceback = tb != nullptr ? Ref::steal(tb) : Ref::none();
+  Ref arg =
+      Ref::steal(PyTuple_Pack(3, reinterpret_cast<PyObject*>(Py_TYPE(exc)), exc, traceback.get()));
+  if (!arg) PyErr_Clear();
+  return arg;
+}
+
+void forget_record_of(PyFrameObject* frame) {
+  if (frame == nullptr || !gSelf.exc_data.frame_exc_info) return;
+  forget_frame_exc_info(&gSelf.exc_data.frame_exc_info, reinterpret_cast<PyObject*>(frame));
+}
+
+// A handler of the frame took the exception. Should it raise again, PY_UNWIND names it.
+PyObject* on_exception_handled(PyObject*, PyObject* const*, Py_ssize_t) {
+  forget_record_of(PyEval_GetFrame());
+  Py_RETURN_NONE;
+}
+
+// Left by an exception. The event names it: it becomes the frame's record for the return
+// dispatch (a handler that raised again had dropped the first), and goes with the frame.
+PyObject* on_unwind(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
+  PyFrameObject* frame = PyEval_GetFrame();
+  if (frame != nullptr && nargs > 2 && PyExceptionInstance_Check(args[2])) {
+    Ref arg = exception_arg(args[2]);
+    if (arg && set_frame_exc_info(&gSelf.exc_data.frame_exc_info,
+                                  reinterpret_cast<PyObject*>(frame), arg.get()) != 0) {
+      PyErr_Clear();
+    }
+  }
+  PyObject* answer = deliver(PyTrace_RETURN, nullptr);  // left by an exception: no value
+  forget_record_of(frame);
+  return answer;
 }
 
 // ---- Quiet places -----------------------------------------------------------------------------
@@ -222,16 +261,9 @@ PyObject* on_jump(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
   return quiet_if_possible(deliver(PyTrace_LINE, nullptr), args[0], from);
 }
 
-// The trace function's exception argument: (type, value, traceback).
 PyObject* deliver_exception(PyObject* exc) {
-  PyObject* tb = PyException_GetTraceback(exc);  // new reference or null
-  Ref traceback = tb != nullptr ? Ref::steal(tb) : Ref::none();
-  Ref arg =
-      Ref::steal(PyTuple_Pack(3, reinterpret_cast<PyObject*>(Py_TYPE(exc)), exc, traceback.get()));
-  if (!arg) {
-    PyErr_Clear();  // without memory for the tuple this event goes unseen
-    Py_RETURN_NONE;
-  }
+  Ref arg = exception_arg(exc);
+  if (!arg) Py_RETURN_NONE;  // without memory for the tuple this event goes unseen
   return deliver(PyTrace_EXCEPTION, arg.get());
 }
 
@@ -245,15 +277,21 @@ PyObject* on_raise(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
 // versions and the value on others. The trace function reports a StopIteration.
 PyObject* on_stop_iteration(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
   if (nargs < 3) Py_RETURN_NONE;
+  PyObject* answer = nullptr;
   if (PyObject_TypeCheck(args[2], reinterpret_cast<PyTypeObject*>(PyExc_StopIteration))) {
-    return deliver_exception(args[2]);
+    answer = deliver_exception(args[2]);
+  } else {
+    Ref exc = Ref::steal(PyObject_CallOneArg(PyExc_StopIteration, args[2]));
+    if (!exc) {
+      PyErr_Clear();
+      Py_RETURN_NONE;
+    }
+    answer = deliver_exception(exc.get());
   }
-  Ref exc = Ref::steal(PyObject_CallOneArg(PyExc_StopIteration, args[2]));
-  if (!exc) {
-    PyErr_Clear();
-    Py_RETURN_NONE;
-  }
-  return deliver_exception(exc.get());
+  // The loop or the delegation consumes it on the spot: it never leaves the frame, and no
+  // handler event follows.
+  forget_record_of(PyEval_GetFrame());
+  return answer;
 }
 
 // ---- The tool ---------------------------------------------------------------------------------
@@ -272,11 +310,17 @@ struct EventCallback {
   }
 
 EventCallback gCallbacks[] = {
-    CALLBACK("PY_START", on_call),   CALLBACK("PY_RESUME", on_call),
-    CALLBACK("PY_THROW", on_throw),  CALLBACK("PY_RETURN", on_return),
-    CALLBACK("PY_YIELD", on_return), CALLBACK("PY_UNWIND", on_unwind),
-    CALLBACK("LINE", on_line),       CALLBACK("JUMP", on_jump),
-    CALLBACK("RAISE", on_raise),     CALLBACK("STOP_ITERATION", on_stop_iteration),
+    CALLBACK("PY_START", on_call),
+    CALLBACK("PY_RESUME", on_call),
+    CALLBACK("PY_THROW", on_throw),
+    CALLBACK("PY_RETURN", on_return),
+    CALLBACK("PY_YIELD", on_return),
+    CALLBACK("PY_UNWIND", on_unwind),
+    CALLBACK("LINE", on_line),
+    CALLBACK("JUMP", on_jump),
+    CALLBACK("RAISE", on_raise),
+    CALLBACK("STOP_ITERATION", on_stop_iteration),
+    CALLBACK("EXCEPTION_HANDLED", on_exception_handled),
 };
 
 #undef CALLBACK

@@ -1,6 +1,6 @@
 // exceptops.h: what the exception decision knows besides the byte code: the locations where
-// the user asked not to stop again, the exception records kept per frame until the frame
-// returns, and the list of functions known to catch and print exceptions.
+// the user asked not to stop again, the exception records kept per frame while an exception
+// passes through it, and the list of functions known to catch and print exceptions.
 #pragma once
 
 #include <Python.h>
@@ -49,7 +49,7 @@ int __tracer_exc_filtered_hack(const char* filename, int lineno);
 // ---- Per-frame exception records and the catch-info index (frameexc.cpp, catchinfo.cpp) ----
 
 struct ExcData {
-  Ref frame_exc_info;  // dict frame -> argument of its latest exception event, or null
+  Ref frame_exc_info;  // dict frame -> argument of the exception in flight there, or null
   Ref catch_info;      // dict function name -> list of catch-info instances, or null
   Ref co_name_str;     // cached attribute names
   Ref mod_name_str;
@@ -66,15 +66,8 @@ void reset_exc_data(ExcData* data);
 int set_frame_exc_info(Ref* frame_exc_info, PyObject* frame, PyObject* exc_arg);
 // The recorded argument (borrowed), or null. Sets no error.
 PyObject* find_frame_exc_info(Ref* frame_exc_info, PyObject* frame);
-// Drops the frame's record and collects dead ones; keeps the pending error. Always 0.
+// Drops the frame's record, if any; keeps the pending error. Always 0.
 int forget_frame_exc_info(Ref* frame_exc_info, PyObject* frame);
-// Drops records whose frames only the records themselves still reach; 0, or -1 when a
-// deletion failed.
-int gc_exc_info_for_frame(Ref* frame_exc_info);
-// How often `frame` occurs in the back chains of the traceback's entries (an estimate of the
-// references the traceback holds to it); 0 past 1000 entries.
-Py_ssize_t ref_count_in_tb(PyObject* traceback, PyObject* frame);
-
 // Builds the index from a list of catch-info instances; 0, or -1 with the error set.
 int set_catch_info_list(ExcData* data, PyObject* list);
 // New reference to the first instance that describes the frame's function, or null.

@@ -15,6 +15,7 @@
 #include "module/methods.h"
 #include "support/dbgcommon.h"
 #include "support/dprintf.h"
+#include "support/pycompat.h"
 #include "threads/threadops.h"
 
 namespace {
@@ -58,12 +59,12 @@ bool default_import_is_not_our_hook(PyObject* default_import) {
     PyErr_Clear();
     return true;
   }
-  int same = PyObject_RichCompareBool(hook.get(), default_import, Py_EQ);
-  if (same == 0) return true;
-  if (same > 0) {
-    PyErr_SetString(PyExc_AssertionError,
-                    "The default import hook cannot be equal to our import hook");
-  }
+  // Any function made from the same method definition is ours: the one installed into the
+  // builtins is the builtins module's, not this module's.
+  PyMethodDef* ours = compat::method_def_of(hook.get());
+  if (ours == nullptr || compat::method_def_of(default_import) != ours) return true;
+  PyErr_SetString(PyExc_AssertionError,
+                  "The default import hook cannot be equal to our import hook");
   return false;
 }
 }  // namespace
@@ -259,12 +260,15 @@ PyMethodDef gMethods[] = {
            "remaining buffer space, it is truncated.  Returns # of bytes copied."),
     METHOD("PyFrame_LocalsToFast", wrap_PyFrame_LocalsToFast,
            "Wrapper around PyFrame_LocalsToFast internal api call."),
-    // The trace function, the thread hooks and __import__ carry no docstring.
+    // The trace function, the thread hooks and __import__ carry no docstring. __import__
+    // carries the interpreter's signature, in the form that leaves __doc__ empty and gives
+    // inspect.signature what it gives for the interpreter's own __import__.
     {"trace_dispatch", _tracer_trace_dispatch, METH_VARARGS, nullptr},
     {"bootstrap_new_thread", _tracer_bootstrap_new_thread, METH_VARARGS, nullptr},
     {"thread_exiting", _tracer_thread_exiting, METH_VARARGS, nullptr},
     {"__import__", reinterpret_cast<PyCFunction>(reinterpret_cast<void (*)()>(_tracer_import)),
-     METH_VARARGS | METH_KEYWORDS, nullptr},
+     METH_VARARGS | METH_KEYWORDS,
+     "__import__(name, globals=None, locals=None, fromlist=(), level=0)\n--\n\n"},
     {nullptr, nullptr, 0, nullptr},
 };
 

@@ -161,6 +161,70 @@ inline bool use_tracing_set(PyThreadState* ts, int value) noexcept {
   return true;
 }
 
+// ---- Builtin functions ---------------------------------------------------------------------
+
+// The method definition behind a builtin function or method object, or null for any other
+// object. Borrowed: it lives as long as the method table it comes from.
+inline PyMethodDef* method_def_of(PyObject* function) noexcept {
+  if (!PyCFunction_Check(function)) return nullptr;
+  return reinterpret_cast<PyCFunctionObject*>(function)->m_ml;
+}
+
+// ---- Recursion room ----------------------------------------------------------------------
+
+// How many more nested calls the thread may make before the interpreter raises RecursionError
+// (private fields). 3.12 and 3.13 count Python frames and C calls apart: the smaller budget.
+// From 3.14 on C calls are bounded by the machine stack, which keeps a margin of its own
+// beyond the point where RecursionError is raised: only Python frames are counted.
+inline int recursion_room_left(PyThreadState* ts) noexcept {
+#if PY_VERSION_HEX < 0x030C0000
+  return ts->recursion_remaining;
+#elif PY_VERSION_HEX < 0x030E0000
+  return ts->py_recursion_remaining < ts->c_recursion_remaining ? ts->py_recursion_remaining
+                                                                : ts->c_recursion_remaining;
+#else
+  return ts->py_recursion_remaining;
+#endif
+}
+
+// Lets the thread nest `extra` more calls (a negative number takes them back). Only the
+// thread's own budget moves: the limit the program set, and other threads, never see it.
+inline void recursion_room_add(PyThreadState* ts, int extra) noexcept {
+#if PY_VERSION_HEX < 0x030C0000
+  ts->recursion_remaining += extra;
+#elif PY_VERSION_HEX < 0x030E0000
+  ts->py_recursion_remaining += extra;
+  ts->c_recursion_remaining += extra;
+#else
+  ts->py_recursion_remaining += extra;
+#endif
+}
+
+// While it lives, the calling thread has at least `room` nested calls left: the core's own
+// calls made close to the program's recursion limit (the server side's callbacks, the
+// attributes an exception analysis reads) must not raise a RecursionError the program would
+// not have seen. Whatever was added is taken back at the end, so the program's own budget is
+// what it was.
+class RecursionRoom {
+ public:
+  explicit RecursionRoom(int room) noexcept : ts_(PyThreadState_Get()) {
+    int left = recursion_room_left(ts_);
+    if (left < room) {
+      added_ = room - left;
+      recursion_room_add(ts_, added_);
+    }
+  }
+  ~RecursionRoom() {
+    if (added_ != 0) recursion_room_add(ts_, -added_);
+  }
+  RecursionRoom(const RecursionRoom&) = delete;
+  RecursionRoom& operator=(const RecursionRoom&) = delete;
+
+ private:
+  PyThreadState* ts_;
+  int added_ = 0;
+};
+
 // ---- The pending exception -------------------------------------------------------------
 
 // Holds the calling thread's pending exception while the core runs Python code of its own.
@@ -184,9 +248,7 @@ class PendingError {
 #endif
     exc_ = nullptr;
   }
-  bool empty() const noexcept {
-    return exc_ == nullptr && type_ == nullptr;
-  }
+  bool empty() const noexcept { return exc_ == nullptr && type_ == nullptr; }
 
   // Writes the held exception and its traceback to sys.stderr and keeps holding it. Unlike
   // PyErr_Print this never exits the process on SystemExit and leaves sys.last_* alone:

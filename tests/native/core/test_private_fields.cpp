@@ -2,13 +2,14 @@
 // what the public API or the Python level says on the interpreter the test embeds. A field
 // that moves or changes meaning in a new CPython version fails here, by name, before the
 // core misbehaves with it: the thread-state fields behind the accessors of pycompat.h, the
-// frame type's f_trace descriptor, and the code-object fields the name and dispatch code
-// read.
+// frame type's f_trace descriptor, the code-object fields the name and dispatch code read,
+// and the thread's recursion budget.
 #include "support/pycompat.h"
 
 #include <gtest/gtest.h>
 
 #include <thread>
+#include <vector>
 
 #include "core_test_support.h"
 
@@ -130,8 +131,8 @@ TEST_F(PrivateFieldTest, FTraceDescriptorIsTheFrameTypesOwn) {
 }
 
 TEST_F(PrivateFieldTest, CodeObjectFieldsAreTheAttributes) {
-  Ref code = Ref::steal(
-      Py_CompileString("def f(a):\n    return a + 12345\n", "<fields>", Py_file_input));
+  Ref code =
+      Ref::steal(Py_CompileString("def f(a):\n    return a + 12345\n", "<fields>", Py_file_input));
   ASSERT_TRUE(code);
   // The function's own code object is the first constant of the module's.
   Ref consts = Ref::steal(PyObject_GetAttrString(code.get(), "co_consts"));
@@ -150,6 +151,95 @@ TEST_F(PrivateFieldTest, CodeObjectFieldsAreTheAttributes) {
   EXPECT_EQ(PyLong_AsLong(flags.get()), fields->co_flags);
   EXPECT_TRUE(fields->co_flags & CO_OPTIMIZED);  // a function's code
   EXPECT_FALSE(reinterpret_cast<PyCodeObject*>(code.get())->co_flags & CO_OPTIMIZED);
+}
+
+constexpr const char* kDepthProgram = R"(
+import sys
+
+def at_depth(n):
+    if n:
+        return at_depth(n - 1)
+    probe()
+
+def nest(n):
+    return n == 0 or nest(n - 1)
+
+def to_the_limit():
+    try:
+        to_the_limit()
+    except RecursionError:
+        probe()
+)";
+
+TEST_F(PrivateFieldTest, RecursionBudgetCountsPythonFrames) {
+  Ref globals = coretest::make_namespace(kDepthProgram);
+  PyThreadState* ts = PyThreadState_Get();
+  const int before = compat::recursion_room_left(ts);
+  std::vector<int> left;
+  for (int depth : {0, 10, 30}) {
+    Ref code = Ref::steal(PyUnicode_FromFormat("lambda: at_depth(%d)", depth));
+    Ref fn = Ref::steal(
+        PyRun_String(PyUnicode_AsUTF8(code.get()), Py_eval_input, globals.get(), globals.get()));
+    ASSERT_TRUE(fn);
+    PyDict_SetItemString(globals.get(), "run_it", fn.get());
+    bool ran = coretest::run_in_frame(globals.get(), "run_it", [&](PyFrameObject*) {
+      left.push_back(compat::recursion_room_left(ts));
+    });
+    ASSERT_TRUE(ran);
+  }
+  ASSERT_EQ(left.size(), 3u);
+  {
+    // Far from the limit a room adds nothing.
+    compat::RecursionRoom room(50);
+    EXPECT_EQ(compat::recursion_room_left(ts), before);
+  }
+  EXPECT_EQ(left[0] - left[1], 10);
+  EXPECT_EQ(left[0] - left[2], 30);
+  EXPECT_LT(left[0], Py_GetRecursionLimit());
+  EXPECT_GT(left[0], Py_GetRecursionLimit() - 20);
+}
+
+TEST_F(PrivateFieldTest, RecursionRoomLetsNestedCallsRunAtTheLimitAndGivesItBack) {
+  Ref globals = coretest::make_namespace(kDepthProgram);
+  PyThreadState* ts = PyThreadState_Get();
+  const int limit = Py_GetRecursionLimit();
+  bool done = false;
+  bool ran = coretest::run_in_frame(globals.get(), "to_the_limit", [&](PyFrameObject*) {
+    if (done) return;
+    done = true;
+    PyObject* nest = coretest::item(globals.get(), "nest");
+    const int left = compat::recursion_room_left(ts);
+    EXPECT_LT(left, 10);
+    Ref failed = Ref::steal(PyObject_CallFunction(nest, "i", 20));
+    EXPECT_FALSE(failed) << "20 nested calls fit without room";
+    EXPECT_TRUE(PyErr_ExceptionMatches(PyExc_RecursionError));
+    PyErr_Clear();
+    {
+      compat::RecursionRoom room(50);
+      EXPECT_GE(compat::recursion_room_left(ts), 50);
+      Ref nested = Ref::steal(PyObject_CallFunction(nest, "i", 20));
+      EXPECT_TRUE(nested) << "20 nested calls within the room";
+      PyErr_Clear();
+      EXPECT_EQ(Py_GetRecursionLimit(), limit);
+    }
+    EXPECT_EQ(compat::recursion_room_left(ts), left);
+  });
+  EXPECT_TRUE(ran && done);
+  EXPECT_EQ(PyErr_Occurred(), nullptr);
+}
+
+TEST_F(PrivateFieldTest, MethodDefinitionIsTheBuiltinFunctionsOwn) {
+  Ref builtins = Ref::steal(PyImport_ImportModule("builtins"));
+  ASSERT_TRUE(builtins);
+  Ref len = Ref::steal(PyObject_GetAttrString(builtins.get(), "len"));
+  ASSERT_TRUE(len);
+  PyMethodDef* def = compat::method_def_of(len.get());
+  ASSERT_NE(def, nullptr);
+  EXPECT_STREQ(def->ml_name, "len");
+  Ref again = Ref::steal(PyCFunction_NewEx(def, builtins.get(), nullptr));
+  ASSERT_TRUE(again);
+  EXPECT_EQ(PyObject_RichCompareBool(again.get(), len.get(), Py_EQ), 1);
+  EXPECT_EQ(compat::method_def_of(builtins.get()), nullptr);
 }
 
 }  // namespace

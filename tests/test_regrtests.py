@@ -1,0 +1,31 @@
+"""CPython's own regression tests as the judge that the program behaves under the debugger as
+it does untraced: a small selection, run freely under `python -m selvane` with stdin closed,
+must give the same results as untraced with nothing printed by the debugger. The whole list is
+`tools/regrtests-traced` (see the README).
+
+The selection runs with `--exceptions never`: it covers what the debugger keeps about caught
+exceptions (finalisers, deep unwinding, exceptions in handlers and `with` blocks), not the
+exception stops themselves.
+"""
+
+import os
+import subprocess
+import sys
+
+import pytest
+
+HERE = os.path.dirname(os.path.abspath(__file__))
+TOOL = os.path.join(os.path.dirname(HERE), "tools", "regrtests-traced")
+SELECTION = ["test.test_exceptions", "test.test_json", "test.test_with",
+             "test.test_contextlib", "test.test_raise"]
+
+
+def test_a_selection_of_the_interpreters_regression_tests_runs_as_untraced(tmp_path):
+    run = subprocess.run([sys.executable, TOOL, "--python", sys.executable,
+                          "--exceptions", "never", *SELECTION], capture_output=True,
+                         text=True, timeout=1200, cwd=str(tmp_path))
+    lines = run.stdout.splitlines()
+    if lines and all(line.endswith("skipped") for line in lines[:-1]):
+        pytest.skip("this interpreter has no regression test package")
+    assert run.returncode == 0, run.stdout + run.stderr
+    assert sum(line.startswith("same ") for line in lines) >= 1, run.stdout
