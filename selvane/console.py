@@ -171,14 +171,36 @@ class Console(cmd.Cmd, Frontend):
         elif stop.kind == "exception":
             exc_type, value, _tb = stop.exc
             self.say(f"!! {_exception_text(exc_type, value)}")
-            if stop.handler is not None:
-                self.say(f"   (will be caught in {self._where(stop.handler)})")
-            elif self.session.prints_exceptions(stop.frame):
-                self.say("   (caught here and printed)")
-            elif stop.thread == threading.main_thread().ident:
-                self.say("   (not caught: the program ends with it)")
-            else:
-                self.say("   (not caught: the thread ends with it)")
+            if stop.inner is not None and stop.inner is not stop.frame:
+                self.say(f"   raised at {self._where(stop.inner)}")
+            self.say(f"   ({self._catch_text(stop)})")
+            for link in stop.chain[1:]:
+                relation = "caused by" if link.relation == "cause" else "while handling"
+                self.say(f"   {relation} {self._link_text(link)}")
+
+    def _catch_text(self, stop):
+        catch = stop.catch
+        kind = catch.kind if catch is not None else "uncaught"
+        if kind == "caught" and catch.frame is not None:
+            return f"will be caught in {self._where(catch.frame)}"
+        if kind == "c-code":
+            return f"may be caught by C code called at {_show_path(catch.file)}:{catch.line}"
+        if kind == "with":
+            return f"a `with` at {_show_path(catch.file)}:{catch.line} may suppress it"
+        if self.session.prints_exceptions(stop.frame):
+            return "caught here and printed"
+        if stop.thread == threading.main_thread().ident:
+            return "not caught: the program ends with it"
+        return "not caught: the thread ends with it"
+
+    def _link_text(self, link):
+        """An exception of a chain in one line: what it is and where it was raised."""
+        text = _exception_text(type(link.exc), link.exc)
+        frame, line = link.raise_site
+        if frame is not None:
+            text += f"  (raised at {_show_path(frame.f_code.co_filename)}:{line} in " \
+                    f"{frame.f_code.co_name}())"
+        return text
 
     def _where(self, frame):
         place = self.session.place(frame)
@@ -328,8 +350,20 @@ class Console(cmd.Cmd, Frontend):
         session = self.session
         for frame in session.stack():
             mark = ">" if frame is session.frame else " "
-            self.say(f"{mark} {self._where(frame)}")
+            self.say(f"{mark} {self._where(frame)}{self._frame_note(frame)}")
             self.say(f"    -> {self._source(frame)}")
+
+    def _frame_note(self, frame):
+        """Marks a frame the exception has left, and the place it was raised when the
+        program stands elsewhere."""
+        session = self.session
+        notes = []
+        if session.is_finished(frame):
+            notes.append("finished")
+        stop = session.stop
+        if stop is not None and frame is session.raise_site() and frame is not stop.frame:
+            notes.append("raised here")
+        return f"  ({'; '.join(notes)})" if notes else ""
 
     do_w = do_bt = do_where
 
@@ -337,7 +371,7 @@ class Console(cmd.Cmd, Frontend):
         count = _int_arg(arg, "count") if arg.strip() else 1
         frame = self.session.move(direction * count)
         self._list_next = None
-        self.say(f"> {self._where(frame)}")
+        self.say(f"> {self._where(frame)}{self._frame_note(frame)}")
         self.say(f"-> {self._source(frame)}")
 
     def do_up(self, arg):
@@ -558,7 +592,12 @@ class Console(cmd.Cmd, Frontend):
     # ---- exceptions ------------------------------------------------------------------------
 
     def do_catch(self, arg):
-        """catch never|always|unhandled|printed: when exceptions stop the program.
+        """catch never|always|unhandled|user-unhandled|printed: when exceptions stop the
+        program. unhandled: where nothing will catch the exception (an exception that C
+        code or a `with` may still end stops in the first frame from which nothing can
+        catch it). user-unhandled: also where an exception leaves the program's own code
+        into library code that will catch it (the standard library, site-packages, and
+        the folders given with --library), as a test runner catches a failing test.
         catch always TYPE...: always stop on these types (unless the raising function
         catches them itself). catch never TYPE...: never stop on them.
         catch: show the settings."""
@@ -566,6 +605,9 @@ class Console(cmd.Cmd, Frontend):
         words = arg.split()
         if not words:
             self.say(f"exceptions stop: {session.exception_mode()}")
+            if session.exception_mode() == "user-unhandled":
+                self.say("library code: " + ", ".join(map(_show_path,
+                                                          session.library_paths)))
             self.say("always stop on: " + (_type_names(session.always_stop()) or "-"))
             self.say("never stop on: " + (_type_names(session.never_stop()) or "-"))
             return
@@ -579,8 +621,26 @@ class Console(cmd.Cmd, Frontend):
             session.set_never_stop(words[1:])
             self.say("never stop on: " + _type_names(session.never_stop()))
         else:
-            self.error("usage: catch [never|always|unhandled|printed] | catch always|never "
-                       "TYPE...")
+            self.error("usage: catch [never|always|unhandled|user-unhandled|printed] | "
+                       "catch always|never TYPE...")
+
+    def do_exceptions(self, arg):
+        """exceptions [NUMBER]: at an exception stop, list the exception and those it was
+        raised from or while handling (numbered from the oldest; `>` marks the one shown);
+        with a number, show that exception's frames (where, up, down, p) from where it was
+        raised. The frames an exception has left can be read, not changed."""
+        session = self.session
+        links, selected = session.exception_list()  # not at an exception stop: says so
+        if not arg.strip():
+            for number, link in enumerate(links):
+                mark = ">" if number == selected else " "
+                self.say(f"{mark} {number:>2} {self._link_text(link)}")
+            return
+        link, frame = session.select_exception(_int_arg(arg, "exceptions"))
+        self._list_next = None
+        self.say(f"!! {_exception_text(type(link.exc), link.exc)}")
+        self.say(f"> {self._where(frame)}{self._frame_note(frame)}")
+        self.say(f"-> {self._source(frame)}")
 
     def do_ignore_here(self, arg):
         """ignore-here: do not stop again on exceptions raised where the current one was."""
@@ -681,6 +741,7 @@ _SUMMARY = [
     ("ignore N COUNT", "pass a breakpoint COUNT times"),
     ("breakpoints", "list breakpoints and hits"),
     ("catch [MODE | always|never TYPE...]", "exception stops"),
+    ("exceptions [N]", "the exception's chain; show one"),
     ("ignore-here", "stop no more at this exception's place"),
     ("threads / thread N", "list threads, show one"),
     ("imports", "modules loaded since last asked"),
