@@ -1115,12 +1115,15 @@ def library_paths(extra=()):
     written and as its real path, since a code object's file name may carry either."""
     found = [os.path.dirname(os.__file__)]
     site = sys.modules.get("site")  # loaded at start-up unless the interpreter ran with -S
-    for name in ("getsitepackages", "getusersitepackages"):
-        try:
-            value = getattr(site, name)()
-        except Exception:
-            continue
-        found.extend([value] if isinstance(value, str) else value)
+    try:
+        found.extend(site.getsitepackages())
+    except Exception:
+        pass
+    # Read, not asked for: site.getusersitepackages() would set the module's USER_SITE
+    # where the interpreter left it unset (-s), which the program could see.
+    user_site = getattr(site, "USER_SITE", None)
+    if isinstance(user_site, str):
+        found.append(user_site)
     for path in extra:
         if not os.path.exists(path):
             raise SessionError(f"no file or folder {path!r}")
