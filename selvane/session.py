@@ -103,11 +103,18 @@ class ChainLink:
     or "context" (raised while it was being handled)."""
     exc: BaseException
     relation: str = None
+    # Its traceback as the stop's event gave it: the exception being raised may not carry
+    # it yet (3.11 attaches it later). None: the exception's own.
+    tb: object = None
+
+    @property
+    def traceback(self):
+        return self.tb if self.tb is not None else getattr(self.exc, "__traceback__", None)
 
     @property
     def raise_site(self):
         """(frame, line) where it was raised, from its traceback, or (None, 0)."""
-        tb = getattr(self.exc, "__traceback__", None)
+        tb = self.traceback
         last = None
         while tb is not None:
             last = tb
@@ -511,6 +518,7 @@ class Session:
         stop.finished = [frame for frame, _line in below if not self._is_internal(frame)]
         self._finished_lines = dict(below)
         stop.chain = exception_chain(value) or [ChainLink(value)]
+        stop.chain[0].tb = tb
 
     def predict_catch(self, frame, exc):
         """The core's answer to what will end `exc` raised in (or passing through) `frame`.
@@ -710,7 +718,7 @@ class Session:
             frames = live + stop.finished
             lines = self._finished_lines
         else:
-            traced = [(frame, line) for frame, line in _traceback_entries(link.exc)
+            traced = [(frame, line) for frame, line in _traceback_entries(link.traceback)
                       if not self._is_internal(frame)
                       and self.frame_category(frame) != IMPLEMENTATION_FRAME]
             frames = [frame for frame, _line in traced]
@@ -1136,10 +1144,9 @@ def library_paths(extra=()):
     return paths
 
 
-def _traceback_entries(exc):
-    """(frame, line) of each entry of the exception's traceback, the outermost first."""
+def _traceback_entries(tb):
+    """(frame, line) of each entry of a traceback, the outermost first."""
     entries = []
-    tb = getattr(exc, "__traceback__", None)
     while tb is not None and len(entries) < _MAX_TRACEBACK:
         entries.append((tb.tb_frame, tb.tb_lineno))
         tb = tb.tb_next
