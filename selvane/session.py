@@ -506,15 +506,10 @@ class Session:
         if stop.catch.kind == "caught":
             stop.handler = stop.catch.frame
         stop.exiting = bool(core.exiting_on_exception())
-        stop.inner, stop.raise_line = stop.frame, stop.frame.f_lineno
-        below = _traceback_below(tb, stop.frame)
-        if below:
-            stop.inner, stop.raise_line = below[-1]
-        elif tb is not None:
-            last = tb
-            while last.tb_next is not None:
-                last = last.tb_next
-            stop.inner, stop.raise_line = last.tb_frame, last.tb_lineno
+        entries = _traceback_entries(tb)
+        stop.inner, stop.raise_line = entries[-1] if entries else (stop.frame,
+                                                                   stop.frame.f_lineno)
+        below = _below(entries, stop.frame)
         stop.finished = [frame for frame, _line in below if not self._is_internal(frame)]
         self._finished_lines = dict(below)
         stop.chain = exception_chain(value) or [ChainLink(value)]
@@ -529,7 +524,8 @@ class Session:
             kind, catcher, file, line = core.analysis.predict_catch(frame, exc)
         except Exception:
             return Catch("uncaught")
-        if kind != "uncaught" and (catcher is None or self._is_internal(catcher)):
+        if kind == "caught" and catcher is None or \
+                catcher is not None and self._is_internal(catcher):
             return Catch("uncaught")
         return Catch(kind, catcher, file, line)
 
@@ -589,6 +585,8 @@ class Session:
         stop = self.stop
         if stop is None:
             raise SessionError("the program is not stopped")
+        if self.is_finished(self.frame):
+            raise SessionError("cannot jump in a finished frame (the exception has left it)")
         if self.frame is not stop.frame:
             where = ("go back there with `down`" if self._is_caller(self.frame, stop.frame)
                      else "select it with `thread` and `down`")
@@ -1156,13 +1154,9 @@ def _traceback_entries(tb):
 _MAX_TRACEBACK = 10000
 
 
-def _traceback_below(tb, frame):
-    """(frame, line) of the traceback entries below the last entry of `frame`: the frames an
-    exception reported in `frame` has already left, down to where it was raised."""
-    entries = []
-    while tb is not None and len(entries) < _MAX_TRACEBACK:
-        entries.append((tb.tb_frame, tb.tb_lineno))
-        tb = tb.tb_next
+def _below(entries, frame):
+    """The traceback entries below the last entry of `frame`: the frames an exception
+    reported in `frame` has already left, down to where it was raised."""
     last = max((i for i, (known, _line) in enumerate(entries) if known is frame), default=None)
     return entries[last + 1:] if last is not None else []
 

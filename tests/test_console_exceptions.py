@@ -225,6 +225,8 @@ def test_frames_the_exception_left_at_an_outer_stop(tmp_path):
                                        "in it\n")
         assert dbg.do("!values['c'] = 3") .startswith("*** cannot change a finished frame")
         assert dbg.do("p key") == "'b'\n"
+        assert dbg.do("jump 3") == ("*** cannot jump in a finished frame (the exception has "
+                                    "left it)\n")
         assert dbg.do("down") == "*** newest frame\n"
         assert dbg.do("up") == '> prog.py:8 in main()\n-> total = lookup(values, "b")\n'
         assert dbg.do("!values['z'] = 26") == ""
