@@ -17,25 +17,23 @@ class Thing:
         raise AttributeError("no value")
 
 
-class Exits:
+class Swallows:
     def __enter__(self):
         return self
 
     def __exit__(self, *exc):
-        return False
+        return True
 
 
 def risky():
-    with Exits():
+    with Swallows():
         raise ValueError("inside")
 
 
 def main():
     print("has", hasattr(Thing(), "value"))
-    try:
-        risky()
-    except ValueError:
-        print("caught")
+    risky()
+    print("swallowed")
     with contextlib.suppress(KeyError):
         raise KeyError("suppressed")
     print("done")
@@ -59,11 +57,11 @@ def test_each_reason_is_shown(tmp_path):
         assert "!! ValueError: inside" in out
         assert "   (a `with` at prog.py:19 may suppress it)" in out
         out = dbg.do("c")
-        assert stop_line(out) == "> prog.py:30 in main()"
+        assert stop_line(out) == "> prog.py:28 in main()"
         assert "!! KeyError: 'suppressed'" in out
-        assert "   (will be caught in prog.py:30 in main())" in out
+        assert "   (will be caught in prog.py:28 in main())" in out
         out, status = dbg.finish("c")
-        assert "has False" in out and "caught" in out and "done" in out
+        assert "has False" in out and "swallowed" in out and "done" in out
         assert status == 0
     finally:
         dbg.close()
@@ -401,6 +399,119 @@ def test_failing_pytest_suite_stops_at_each_failing_assertion(tmp_path):
         assert dbg.do("p text") == "'abc'\n"
         out, status = dbg.finish("c")
         assert "3 failed, 1 passed" in out
+        assert status == 1
+    finally:
+        dbg.close()
+
+
+EVERYDAY_PROGRAM = """
+import contextlib
+import copy
+import re
+
+
+class Lazy:
+    @property
+    def value(self):
+        raise AttributeError("not yet")
+
+    def __getattr__(self, name):
+        raise AttributeError(name)
+
+
+class OldSeq:
+    def __getitem__(self, index):
+        if index >= 3:
+            raise IndexError(index)
+        return index
+
+
+@contextlib.contextmanager
+def tolerant():
+    try:
+        yield
+    except ValueError:
+        pass
+
+
+re.compile(r"x(?:y)z")
+print("hasattr", hasattr(Lazy(), "value"))
+print("getattr", getattr(Lazy(), "thing", "default"))
+print("deepcopy", type(copy.deepcopy(Lazy())).__name__)
+print("list", list(OldSeq()))
+with contextlib.suppress(ValueError):
+    raise ValueError("suppressed")
+with tolerant():
+    raise ValueError("tolerated")
+print("end")
+"""
+
+
+def test_everyday_code_that_handles_its_exceptions_does_not_stop(tmp_path):
+    write(tmp_path, "prog.py", EVERYDAY_PROGRAM)
+    dbg = Session.debug(tmp_path, "--no-stop-at-start", "prog.py")
+    try:
+        out, status = dbg.finish()
+        assert "!!" not in out and "(selvane)" not in out
+        assert "hasattr False" in out and "getattr default" in out
+        assert "deepcopy Lazy" in out and "list [0, 1, 2]" in out and "end" in out
+        assert status == 0
+    finally:
+        dbg.close()
+
+
+def test_the_same_exceptions_stop_when_they_escape(tmp_path):
+    # A contextmanager that does not catch this type, and an iteration protocol whose
+    # __getitem__ fails otherwise: each stops, once, with the place it was raised.
+    write(tmp_path, "prog.py", """
+        import contextlib
+
+
+        @contextlib.contextmanager
+        def tolerant():
+            try:
+                yield
+            except ValueError:
+                pass
+
+
+        class BadSeq:
+            def __getitem__(self, index):
+                return {}[index]
+
+
+        def first():
+            with tolerant():
+                raise KeyError("escapes")
+
+
+        def second():
+            return list(BadSeq())
+
+
+        try:
+            first()
+        except KeyError:
+            print("first handled")
+        second()
+    """)
+    dbg = Session.debug(tmp_path, "--no-stop-at-start", "prog.py")
+    try:
+        out = dbg.prompt()
+        assert "first handled" in out
+        assert "!! KeyError: 0" in out
+        # Nothing can catch it once list() lets it through: the stop is in second() or in
+        # BadSeq.__getitem__, and the raise site is shown and reachable.
+        where = dbg.do("where")
+        assert "prog.py:14 in __getitem__()" in where
+        if stop_line(out) == "> prog.py:23 in second()":
+            assert "   raised at prog.py:14 in __getitem__()" in out
+            assert dbg.do("down").startswith("> prog.py:14 in __getitem__()  (finished")
+        else:
+            assert stop_line(out) == "> prog.py:14 in __getitem__()"
+        assert dbg.do("p index") == "0\n"
+        out, status = dbg.finish("c")
+        assert out.count("!!") == 0 and "KeyError: 0" in out
         assert status == 1
     finally:
         dbg.close()
