@@ -143,6 +143,18 @@ bool leaves_frame_unhandled(PyObject* frame, PyObject* exc_arg) {
   return true;
 }
 
+// The stop made as a frame is left: the server side's questions about this frame are told
+// that it is being left.
+int stop_on_leaving_frame(PyObject* frame, PyObject* recorded_exc_arg) {
+  Ref arg = Ref::borrow(recorded_exc_arg);  // held: the callback may drop its record
+  ThreadData* data = this_thread_data();
+  if (data != nullptr) data->exception_leaving_frame = frame;
+  int result = do_exception_callback_if_not_filtered(frame, arg.get());
+  data = this_thread_data();  // the callback may have reset the thread table
+  if (data != nullptr) data->exception_leaving_frame = nullptr;
+  return result;
+}
+
 // The place where the exception really happened: the innermost frame of its traceback.
 Ref innermost_frame(PyObject* frame, PyObject* exc_arg) {
   if (PyTuple_GET_SIZE(exc_arg) < 3) return Ref();
@@ -329,8 +341,7 @@ int dispatch_exception_return(PyObject* frame, PyObject* recorded_exc_arg) {
     if (!arg) return -1;
     result = do_exception_callback_if_not_filtered(frame, arg.get());
   } else if (recorded_exc_arg != nullptr && leaves_frame_unhandled(frame, recorded_exc_arg)) {
-    Ref arg = Ref::borrow(recorded_exc_arg);  // held: the callback may drop its record
-    result = do_exception_callback_if_not_filtered(frame, arg.get());
+    result = stop_on_leaving_frame(frame, recorded_exc_arg);
   }
   ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
   if (data == nullptr) {

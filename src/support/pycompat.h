@@ -357,6 +357,8 @@ struct InterpFrame {
 // frame it runs, owned by the C stack (3.12, 3.13: owner 3) or by the interpreter (3.14+:
 // owner 3 or above); real frames have owners 0 to 2.
 constexpr char kFirstEntryOwner = 3;
+// A finished frame whose record its frame object took over: its value stack is cleared.
+constexpr char kOwnedByFrameObject = 2;
 
 // Stack slots of 3.14+ carry tag bits in their low bits (reference-count deferral, and from
 // 3.15 small ints); an object pointer is the slot without them.
@@ -393,7 +395,7 @@ inline bool frame_entered_from_c(PyFrameObject* frame) noexcept {
 inline PyObject* frame_stack_item(PyFrameObject* frame, int depth) noexcept {
   detail::InterpFrame* f = detail::interp_frame(frame);
   Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(frame)));
-  if (f == nullptr || !code || depth < 0) return nullptr;
+  if (f == nullptr || !code || depth < 0 || f->owner == detail::kOwnedByFrameObject) return nullptr;
   int base = reinterpret_cast<PyCodeObject*>(code.get())->co_nlocalsplus;
   uintptr_t slot = f->localsplus[base + depth];
   if ((slot & detail::kStackTagBits) != 0 && detail::kStackTagBits > 1 && (slot & 3) != 1)

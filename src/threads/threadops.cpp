@@ -136,6 +136,7 @@ void renew_thread_data(ThreadData* data) {
   data->unhandled_stop_exc = nullptr;
   data->unhandled_stop_frame = nullptr;
   data->unhandled_stop_code = nullptr;
+  data->exception_leaving_frame = nullptr;
   data->unhandled_stop_frame = nullptr;
   ++gThreadTableGeneration;
   for (Ref& ref : held) ref.reset();

@@ -59,6 +59,9 @@ struct ThreadData {
   const void* unhandled_stop_exc = nullptr;
   const void* unhandled_stop_frame = nullptr;
   const void* unhandled_stop_code = nullptr;
+  // Borrowed, only compared: the frame an exception is leaving while a stop is made there
+  // (its handlers had their turn; its value stack is gone).
+  const void* exception_leaving_frame = nullptr;
   // How many holders pin this record (see above); only the pinning code changes it.
   int32_t pins = 0;
 };
