@@ -42,6 +42,14 @@ ThreadData* this_thread_data() {
   return data;
 }
 
+// The traceback of an event's argument: the exception object does not always carry it yet
+// when the event is reported (3.11). Borrowed; null when there is none.
+PyObject* traceback_of(PyObject* exc_arg) {
+  if (!PyTuple_Check(exc_arg) || PyTuple_GET_SIZE(exc_arg) < 3) return nullptr;
+  PyObject* tb = PyTuple_GET_ITEM(exc_arg, 2);
+  return PyTraceBack_Check(tb) ? tb : nullptr;
+}
+
 const void* code_of(PyObject* frame) {
   if (!compat::is_plain_frame(frame)) return nullptr;
   Ref code = Ref::steal(
@@ -53,9 +61,9 @@ const void* code_of(PyObject* frame) {
 // same object, whose traceback still passes through the frame of that stop, running the
 // same code. (The traceback keeps that frame alive as long as the exception lives, so a
 // new exception at a reused address does not pass this test by a reused frame alone.)
-bool stopped_on_before(const ThreadData* data, PyObject* exc) {
+bool stopped_on_before(const ThreadData* data, PyObject* exc, PyObject* traceback) {
   if (data->unhandled_stop_exc != exc || !PyExceptionInstance_Check(exc)) return false;
-  Ref entry = Ref::steal(PyException_GetTraceback(exc));
+  Ref entry = Ref::borrow(traceback);
   for (int depth = 0; entry && PyTraceBack_Check(entry.get()) && depth < 100000; ++depth) {
     auto* tb = reinterpret_cast<PyTracebackObject*>(entry.get());
     PyObject* frame = reinterpret_cast<PyObject*>(tb->tb_frame);
@@ -66,9 +74,9 @@ bool stopped_on_before(const ThreadData* data, PyObject* exc) {
 }
 
 // Stops once per exception: the first frame that finds it unhandled takes it.
-bool first_unhandled_stop(ThreadData* data, PyObject* frame, PyObject* exc) {
+bool first_unhandled_stop(ThreadData* data, PyObject* frame, PyObject* exc, PyObject* traceback) {
   if (data == nullptr) return true;
-  if (stopped_on_before(data, exc)) {
+  if (stopped_on_before(data, exc, traceback)) {
     do_dprintf(kDbgFlow, "  already stopped on\n");
     return false;
   }
@@ -81,14 +89,14 @@ bool first_unhandled_stop(ThreadData* data, PyObject* frame, PyObject* exc) {
 // Rule: an exception in the thread's bottom frame that nothing there can catch ends the
 // program. Stop (unless an inner frame already stopped on it), and let the server side know
 // it can close its connection cleanly.
-bool leaves_bottom_frame(PyObject* frame, PyObject* exc) {
+bool leaves_bottom_frame(PyObject* frame, PyObject* exc, PyObject* traceback) {
   if (!compat::is_plain_frame(frame)) return false;
   ThreadData* data = this_thread_data();
   if (data == nullptr) return false;
   if (!data->bot_frame.is(frame) || frame_has_active_handler(frame)) return false;
   do_dprintf(kDbgFlow, "  leaving bottom frame\n");
   data->leaving_bot_frame = 1;
-  return first_unhandled_stop(data, frame, exc);
+  return first_unhandled_stop(data, frame, exc, traceback);
 }
 
 // The question for the handler analysis: from `frame` outward to the thread's bottom frame
@@ -117,14 +125,14 @@ bool leaves_user_code_into_library(PyObject* frame, const CatchPrediction& predi
 // Rules of modes 2 and 3. Where only C code or a `with` exit may end the exception, this
 // event does not stop: the exception events of the outer frames, as it reaches them, decide
 // again, so that a truly unhandled one stops in the first frame nothing can catch it from.
-bool stops_as_unhandled(PyObject* frame, PyObject* exc, bool leaving) {
+bool stops_as_unhandled(PyObject* frame, PyObject* exc, PyObject* traceback, bool leaving) {
   enter_debugger();
   ThreadData* data = this_thread_data();
   CatchPrediction prediction = predict_from(frame, exc, data, leaving);
   bool stop = prediction.kind == CatchKind::kUncaught;
   if (!stop && gSelf.exception_mode == kExcUserUnhandledStop)
     stop = leaves_user_code_into_library(frame, prediction);
-  return stop && first_unhandled_stop(data, frame, exc);
+  return stop && first_unhandled_stop(data, frame, exc, traceback);
 }
 
 // Modes 2 and 3, when a frame is left by an exception that only a `with` exit or C code might
@@ -137,8 +145,9 @@ bool leaves_frame_unhandled(PyObject* frame, PyObject* exc_arg) {
   PyObject* exc = value_of(exc_arg);
   if (!PyExceptionInstance_Check(exc) || matches_list(exc, gSelf.never_stop_excepts)) return false;
   ThreadData* data = this_thread_data();
-  if (data == nullptr || stopped_on_before(data, exc)) return false;
-  if (!stops_as_unhandled(frame, exc, true)) return false;
+  PyObject* traceback = traceback_of(exc_arg);
+  if (data == nullptr || stopped_on_before(data, exc, traceback)) return false;
+  if (!stops_as_unhandled(frame, exc, traceback, true)) return false;
   if (data->bot_frame.is(frame)) data->leaving_bot_frame = 1;
   return true;
 }
@@ -281,7 +290,8 @@ int stop_at_exception_no_filters(PyObject* frame, PyObject* exc_type, PyObject* 
   }
   // The instance where the event carries one (always, on current interpreters), else the type.
   PyObject* exc = value_of(exc_arg) != Py_None ? value_of(exc_arg) : exc_type;
-  if (leaves_bottom_frame(frame, exc)) return 1;
+  PyObject* traceback = traceback_of(exc_arg);
+  if (leaves_bottom_frame(frame, exc, traceback)) return 1;
   PyObject* ignored = s.ignored_exception_handlers.get();
   // The handler analysis and the catch-info list may run Python code (the class expressions
   // of except clauses, the instances' attributes): the thread enters the debugger first.
@@ -294,7 +304,7 @@ int stop_at_exception_no_filters(PyObject* frame, PyObject* exc_type, PyObject* 
     }
   }
   if (s.exception_mode == kExcUnhandledStop || s.exception_mode == kExcUserUnhandledStop) {
-    if (stops_as_unhandled(frame, exc, false)) {
+    if (stops_as_unhandled(frame, exc, traceback, false)) {
       do_dprintf(kDbgFlow, "  unhandled\n");
       return 1;
     }
