@@ -52,6 +52,7 @@ int set_library_prefixes(UserCode* user_code, PyObject* prefixes) {
 
 PyObject* library_prefixes(const UserCode* user_code) {
   if (user_code->library_prefixes) return user_code->library_prefixes.new_ref();
+
   return PyTuple_New(0);
 }
 
@@ -61,10 +62,11 @@ bool frame_is_library_code(const UserCode* user_code, PyObject* frame) {
       reinterpret_cast<PyObject*>(PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(frame))));
   if (!code) return false;
   PyObject* filename = reinterpret_cast<PyCodeObject*>(code.get())->co_filename;
-  if (filename == nullptr || !PyUnicode_Check(filename)) return false;
-  if (is_frozen_module_name(filename)) return true;
   PyObject* prefixes = user_code->library_prefixes.get();
-  if (prefixes == nullptr) return false;
+  if (filename == nullptr || !PyUnicode_Check(filename) || prefixes == nullptr ||
+      PyTuple_GET_SIZE(prefixes) == 0)
+    return false;
+  if (is_frozen_module_name(filename)) return true;
   for (Py_ssize_t i = 0; i < PyTuple_GET_SIZE(prefixes); ++i) {
     if (has_prefix(filename, PyTuple_GET_ITEM(prefixes, i))) return true;
   }

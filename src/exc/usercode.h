@@ -4,7 +4,8 @@
 //
 // A code object is library code when its file name begins with one of the given prefixes,
 // or names a module frozen into the interpreter ("<frozen ...>"). Everything else, pseudo
-// files such as "<string>" included, is the user's.
+// files such as "<string>" included, is the user's. Until prefixes are given, all code is
+// the user's.
 #pragma once
 
 #include <Python.h>
