@@ -2,9 +2,10 @@
 commands from the terminal.
 
 The console reads and writes the terminal, never the program's standard streams: with a
-terminal on both standard input and output it uses them (through `input()`, which gives line
-editing, history and completion); otherwise it opens /dev/tty, so that a program reading its
-standard input from a file or a pipe still gets all of it. The session (`selvane.session`)
+terminal on both standard input and output it uses copies of them (and `input()`, which gives
+line editing, history and completion, while the program leaves them in place); otherwise it
+opens /dev/tty, so that a program reading its standard input from a file or a pipe still
+gets all of it. The session (`selvane.session`)
 does the debugging; this module only turns commands into session calls and results into
 text.
 """
@@ -24,24 +25,52 @@ PROMPT = "(selvane) "
 
 
 class Terminal:
-    """Where the console reads commands and writes what it shows."""
+    """Where the console reads commands and writes what it shows.
 
-    def __init__(self, stdin, stdout, line_editing):
+    With the terminal on the standard streams, the console keeps streams of its own on
+    copies of their file descriptors: a program that points descriptors 0 and 1 elsewhere
+    (pytest's output capture does) still leaves the console on the terminal. The line editor
+    (input()) is used while the standard streams are still the terminal."""
+
+    def __init__(self, stdin, stdout, line_editing, editor_streams=None):
         self.stdin = stdin
         self.stdout = stdout
         self.line_editing = line_editing
+        self._editor_streams = editor_streams  # (sys.stdin, sys.stdout) as they were
 
     @classmethod
     def open(cls):
         stdin, stdout = sys.stdin, sys.stdout
         if _isatty(stdin) and _isatty(stdout):
-            return cls(stdin, stdout, True)
+            try:
+                own_in = os.fdopen(os.dup(stdin.fileno()), "r")
+                own_out = os.fdopen(os.dup(stdout.fileno()), "w", buffering=1)
+            except (OSError, ValueError):
+                return cls(stdin, stdout, True, (stdin, stdout))
+            return cls(own_in, own_out, True, (stdin, stdout))
         try:
             tty_in = open("/dev/tty", "r")
             tty_out = open("/dev/tty", "w", buffering=1)
             return cls(tty_in, tty_out, False)
         except OSError:
             return cls(stdin, sys.stderr, False)
+
+    def editor_usable(self):
+        """Whether input() would read and write this terminal: the standard streams are
+        still the ones the console started with, on the same files."""
+        if not self.line_editing or self._editor_streams != (sys.stdin, sys.stdout):
+            return False
+        try:
+            return all(_same_file(mine.fileno(), standard.fileno())
+                       for mine, standard in zip((self.stdin, self.stdout),
+                                                 self._editor_streams))
+        except (OSError, ValueError):
+            return False
+
+
+def _same_file(fd, other):
+    one, two = os.fstat(fd), os.fstat(other)
+    return (one.st_dev, one.st_ino, one.st_rdev) == (two.st_dev, two.st_ino, two.st_rdev)
 
 
 def _isatty(stream):
@@ -114,8 +143,7 @@ class Console(cmd.Cmd, Frontend):
         terminal = self.terminal
         # input() reads sys.stdin and writes sys.stdout: only while they are still the
         # terminal we were given (a program may have replaced them).
-        editing = (terminal.line_editing and sys.stdin is terminal.stdin
-                   and sys.stdout is terminal.stdout)
+        editing = terminal.editor_usable()
         while True:
             session._at_prompt = True
             try:

@@ -61,7 +61,8 @@ def test_each_reason_is_shown(tmp_path):
         assert "!! KeyError: 'suppressed'" in out
         assert "   (will be caught in prog.py:28 in main())" in out
         out, status = dbg.finish("c")
-        assert "has False" in out and "swallowed" in out and "done" in out
+        everything = "".join(dbg.transcript)
+        assert "has False" in everything and "swallowed" in everything and "done" in out
         assert status == 0
     finally:
         dbg.close()
@@ -387,15 +388,16 @@ def test_failing_pytest_suite_stops_at_each_failing_assertion(tmp_path):
     try:
         dbg.prompt()
         out = dbg.do("c")
-        assert stop_line(out) == "> suite/test_numbers.py:11 in test_fails()"
+        # pytest's progress dots stand before the stop on the same line.
+        assert ".> suite/test_numbers.py:11 in test_fails()\n" in out
         assert "!! AssertionError" in out
-        assert "(will be caught in " in out
+        assert "site-packages/" in out.split("(will be caught in ", 1)[1].splitlines()[0]
         assert dbg.do("p result") == "6\n"
         out = dbg.do("c")
-        assert stop_line(out) == "> suite/test_numbers.py:16 in test_raises()"
+        assert "> suite/test_numbers.py:16 in test_raises()\n" in out
         assert "!! IndexError: list index out of range" in out
         out = dbg.do("c")
-        assert stop_line(out) == "> suite/test_numbers.py:21 in test_fails_again()"
+        assert "> suite/test_numbers.py:21 in test_fails_again()\n" in out
         assert dbg.do("p text") == "'abc'\n"
         out, status = dbg.finish("c")
         assert "3 failed, 1 passed" in out
