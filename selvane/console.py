@@ -5,9 +5,8 @@ The console reads and writes the terminal, never the program's standard streams:
 terminal on both standard input and output it uses copies of them (and `input()`, which gives
 line editing, history and completion, while the program leaves them in place); otherwise it
 opens /dev/tty, so that a program reading its standard input from a file or a pipe still
-gets all of it. The session (`selvane.session`)
-does the debugging; this module only turns commands into session calls and results into
-text.
+gets all of it. The session (`selvane.session`) does the debugging; this module only turns
+commands into session calls and results into text.
 """
 
 import cmd
