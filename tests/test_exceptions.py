@@ -306,7 +306,7 @@ def test_unhandled_mode_stops_exactly_on_the_raises_that_escape(tmp_path):
 
     out = tmp_path / "corpus.json"
     runner = os.path.join(os.path.dirname(os.path.abspath(__file__)), "exc_corpus_run.py")
-    subprocess.run([sys.executable, runner, str(out), "600"], check=True, timeout=300,
+    subprocess.run([sys.executable, runner, str(out), "600", "200"], check=True, timeout=300,
                    capture_output=True, text=True, cwd=tmp_path)
     results = json.loads(out.read_text())
     plain = [r for r in results if r["category"] == "plain"]
@@ -319,3 +319,11 @@ def test_unhandled_mode_stops_exactly_on_the_raises_that_escape(tmp_path):
     assert wrong == []
     missed = [r for r in unknown if not set(r["escaped"]) <= set(r["fired"])]
     assert missed == []
+    # Raises that pass C code and `with` blocks (suppressing and not): where only "may be
+    # caught" is known at the raise, the outer frames decide; still exactly the escaping.
+    boundary = [r for r in results if r["category"] == "boundary"]
+    assert len(boundary) == 200
+    escaping = sum(len(r["escaped"]) for r in boundary)
+    assert escaping > 50 and sum(r["raised"] for r in boundary) - escaping > 50
+    wrong = [r for r in boundary if r["fired"] != r["escaped"]]
+    assert wrong == []

@@ -129,24 +129,31 @@ bool stops_as_unhandled(PyObject* frame, PyObject* exc, PyObject* traceback, boo
   enter_debugger();
   ThreadData* data = this_thread_data();
   CatchPrediction prediction = predict_from(frame, exc, data, leaving);
+  if (data != nullptr && !leaving)
+    data->with_may_suppress_in = prediction.kind == CatchKind::kWith ? frame : nullptr;
   bool stop = prediction.kind == CatchKind::kUncaught;
   if (!stop && gSelf.exception_mode == kExcUserUnhandledStop)
     stop = leaves_user_code_into_library(frame, prediction);
   return stop && first_unhandled_stop(data, frame, exc, traceback);
 }
 
-// Modes 2 and 3, when a frame is left by an exception that only a `with` exit or C code might
-// have ended: that exit let it go (no event reports a re-raise), so the frame, still alive,
-// decides again before it is gone.
+// Modes 2 and 3, when a frame is left by an exception that a `with` exit might have ended at
+// its latest exception event: that exit let it go (no event reports a re-raise), so the
+// frame, still alive, decides again before it is gone. Other frames need not: the caller's
+// exception event comes next and decides. The bottom frame always does (no caller of the
+// program's comes), also when other exceptions meanwhile replaced the note.
 bool leaves_frame_unhandled(PyObject* frame, PyObject* exc_arg) {
   int mode = gSelf.exception_mode;
   if (mode != kExcUnhandledStop && mode != kExcUserUnhandledStop) return false;
+  ThreadData* data = this_thread_data();
+  if (data == nullptr || (data->with_may_suppress_in != frame && !data->bot_frame.is(frame)))
+    return false;
+  data->with_may_suppress_in = nullptr;
   if (!PyTuple_Check(exc_arg) || PyTuple_GET_SIZE(exc_arg) < 2) return false;
   PyObject* exc = value_of(exc_arg);
   if (!PyExceptionInstance_Check(exc) || matches_list(exc, gSelf.never_stop_excepts)) return false;
-  ThreadData* data = this_thread_data();
   PyObject* traceback = traceback_of(exc_arg);
-  if (data == nullptr || stopped_on_before(data, exc, traceback)) return false;
+  if (stopped_on_before(data, exc, traceback)) return false;
   if (!stops_as_unhandled(frame, exc, traceback, true)) return false;
   if (data->bot_frame.is(frame)) data->leaving_bot_frame = 1;
   return true;

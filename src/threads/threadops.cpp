@@ -137,6 +137,7 @@ void renew_thread_data(ThreadData* data) {
   data->unhandled_stop_frame = nullptr;
   data->unhandled_stop_code = nullptr;
   data->exception_leaving_frame = nullptr;
+  data->with_may_suppress_in = nullptr;
   data->unhandled_stop_frame = nullptr;
   ++gThreadTableGeneration;
   for (Ref& ref : held) ref.reset();

@@ -62,6 +62,9 @@ struct ThreadData {
   // Borrowed, only compared: the frame an exception is leaving while a stop is made there
   // (its handlers had their turn; its value stack is gone).
   const void* exception_leaving_frame = nullptr;
+  // Borrowed, only compared: the frame whose latest exception event found that only a `with`
+  // exit might end the exception; it decides again when the exception leaves it.
+  const void* with_may_suppress_in = nullptr;
   // How many holders pin this record (see above); only the pinning code changes it.
   int32_t pins = 0;
 };
