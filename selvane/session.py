@@ -203,7 +203,7 @@ class Session:
         self._last_resume = {}  # thread identity -> last resume command
         self._stop_requested = set()  # threads the core was told to stop (interrupt)
         self._interrupt_pending = False
-        self._reported_exc = None  # ids of the exception last shown, its frame and traceback
+        self._reported_exc = None  # id of the exception last shown after a continue
         self._seeking_first_stop = True
         self._first_stop = None
         self._starting_thread = threading.get_ident()
@@ -392,7 +392,7 @@ class Session:
                 core.continue_run()  # the exception shown already, on its way out
                 return
             # Ids only: holding the objects would change when the program's objects die.
-            self._reported_exc = (id(stop.exc[1]), id(stop.frame), id(stop.exc[2]))
+            self._reported_exc = (id(stop.exc[1]), id(stop.frame))
             self._predict(stop)
         elif interrupted and last == "continue_run" and hit is None:
             if not self._interrupt_pending:
@@ -412,15 +412,9 @@ class Session:
         as it unwinds (and not a new exception, which may reuse the old one's memory)."""
         if self._reported_exc is None:
             return False
-        value_id, frame_id, tb_id = self._reported_exc
-        if id(stop.exc[1]) != value_id:
+        value_id, frame_id = self._reported_exc
+        if id(stop.exc[1]) != value_id or id(stop.frame) == frame_id:
             return False
-        if id(stop.frame) == frame_id:
-            # A sub-language's key frame reports its exception once more as the exception
-            # leaves it, with the event's own record (the same traceback object). A new
-            # exception of a Python frame may take the old one's memory: it stops.
-            return id(stop.exc[2]) == tb_id and \
-                self.frame_category(stop.frame, stop.thread) == KEY_FRAME
         tb = stop.exc[2]
         while tb is not None:
             if id(tb.tb_frame) == frame_id:
