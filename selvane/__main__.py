@@ -23,10 +23,17 @@ def _parser():
     parser.add_argument("--break", dest="breaks", action="append", default=[],
                         metavar="FILE:LINE", help="set a breakpoint before the program runs "
                         "(repeatable)")
-    parser.add_argument("--exceptions", choices=("never", "always", "unhandled", "printed"),
+    parser.add_argument("--exceptions",
+                        choices=("never", "always", "unhandled", "user-unhandled", "printed"),
                         default="unhandled",
                         help="which exceptions stop the program (default: unhandled; "
-                        "printed: where the standard library catches and prints them)")
+                        "user-unhandled: also those that leave the program's own code into "
+                        "library code that catches them, as a test runner does; printed: "
+                        "where the standard library catches and prints them)")
+    parser.add_argument("--library", action="append", default=[], metavar="PATH",
+                        help="count the code in this folder (or file) as library code, as "
+                        "the standard library and site-packages are, for --exceptions "
+                        "user-unhandled (repeatable)")
     parser.add_argument("--no-autoquit", action="store_true",
                         help="keep tracing after a thread's outermost frame returns")
     parser.add_argument("--one-thread", action="store_true",
@@ -55,7 +62,7 @@ def _split(argv):
     ours = []
     i = 0
     takes_value = {"-c", "--command", "--break", "--exceptions", "--skip-thread",
-                   "--sub-language"}
+                   "--sub-language", "--library"}
     while i < len(argv):
         arg = argv[i]
         if arg == "-m":
@@ -100,10 +107,14 @@ def main(argv=None):
 
     terminal = Terminal.open()
     console = Console(terminal, commands=options.command)
-    session = Session(console, exceptions=options.exceptions,
-                      autoquit=not options.no_autoquit,
-                      debug_all_threads=not options.one_thread,
-                      skip_threads=options.skip_thread)
+    try:
+        session = Session(console, exceptions=options.exceptions,
+                          autoquit=not options.no_autoquit,
+                          debug_all_threads=not options.one_thread,
+                          skip_threads=options.skip_thread, library=options.library)
+    except SessionError as error:
+        print(f"python -m selvane: {error}", file=sys.stderr)
+        return 2
     session.main_file = program.file
     for spec in options.sub_language:
         try:

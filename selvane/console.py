@@ -2,11 +2,11 @@
 commands from the terminal.
 
 The console reads and writes the terminal, never the program's standard streams: with a
-terminal on both standard input and output it uses them (through `input()`, which gives line
-editing, history and completion); otherwise it opens /dev/tty, so that a program reading its
-standard input from a file or a pipe still gets all of it. The session (`selvane.session`)
-does the debugging; this module only turns commands into session calls and results into
-text.
+terminal on both standard input and output it uses copies of them (and `input()`, which gives
+line editing, history and completion, while the program leaves them in place); otherwise it
+opens /dev/tty, so that a program reading its standard input from a file or a pipe still
+gets all of it. The session (`selvane.session`) does the debugging; this module only turns
+commands into session calls and results into text.
 """
 
 import cmd
@@ -24,24 +24,52 @@ PROMPT = "(selvane) "
 
 
 class Terminal:
-    """Where the console reads commands and writes what it shows."""
+    """Where the console reads commands and writes what it shows.
 
-    def __init__(self, stdin, stdout, line_editing):
+    With the terminal on the standard streams, the console keeps streams of its own on
+    copies of their file descriptors: a program that points descriptors 0 and 1 elsewhere
+    (pytest's output capture does) still leaves the console on the terminal. The line editor
+    (input()) is used while the standard streams are still the terminal."""
+
+    def __init__(self, stdin, stdout, line_editing, editor_streams=None):
         self.stdin = stdin
         self.stdout = stdout
         self.line_editing = line_editing
+        self._editor_streams = editor_streams  # (sys.stdin, sys.stdout) as they were
 
     @classmethod
     def open(cls):
         stdin, stdout = sys.stdin, sys.stdout
         if _isatty(stdin) and _isatty(stdout):
-            return cls(stdin, stdout, True)
+            try:
+                own_in = os.fdopen(os.dup(stdin.fileno()), "r")
+                own_out = os.fdopen(os.dup(stdout.fileno()), "w", buffering=1)
+            except (OSError, ValueError):
+                return cls(stdin, stdout, True, (stdin, stdout))
+            return cls(own_in, own_out, True, (stdin, stdout))
         try:
             tty_in = open("/dev/tty", "r")
             tty_out = open("/dev/tty", "w", buffering=1)
             return cls(tty_in, tty_out, False)
         except OSError:
             return cls(stdin, sys.stderr, False)
+
+    def editor_usable(self):
+        """Whether input() would read and write this terminal: the standard streams are
+        still the ones the console started with, on the same files."""
+        if not self.line_editing or self._editor_streams != (sys.stdin, sys.stdout):
+            return False
+        try:
+            return all(_same_file(mine.fileno(), standard.fileno())
+                       for mine, standard in zip((self.stdin, self.stdout),
+                                                 self._editor_streams))
+        except (OSError, ValueError):
+            return False
+
+
+def _same_file(fd, other):
+    one, two = os.fstat(fd), os.fstat(other)
+    return (one.st_dev, one.st_ino, one.st_rdev) == (two.st_dev, two.st_ino, two.st_rdev)
 
 
 def _isatty(stream):
@@ -114,8 +142,7 @@ class Console(cmd.Cmd, Frontend):
         terminal = self.terminal
         # input() reads sys.stdin and writes sys.stdout: only while they are still the
         # terminal we were given (a program may have replaced them).
-        editing = (terminal.line_editing and sys.stdin is terminal.stdin
-                   and sys.stdout is terminal.stdout)
+        editing = terminal.editor_usable()
         while True:
             session._at_prompt = True
             try:
@@ -171,14 +198,36 @@ class Console(cmd.Cmd, Frontend):
         elif stop.kind == "exception":
             exc_type, value, _tb = stop.exc
             self.say(f"!! {_exception_text(exc_type, value)}")
-            if stop.handler is not None:
-                self.say(f"   (will be caught in {self._where(stop.handler)})")
-            elif self.session.prints_exceptions(stop.frame):
-                self.say("   (caught here and printed)")
-            elif stop.thread == threading.main_thread().ident:
-                self.say("   (not caught: the program ends with it)")
-            else:
-                self.say("   (not caught: the thread ends with it)")
+            if stop.inner is not None and stop.inner is not stop.frame:
+                self.say(f"   raised at {self._where(stop.inner)}")
+            self.say(f"   ({self._catch_text(stop)})")
+            for link in stop.chain[1:]:
+                relation = "caused by" if link.relation == "cause" else "while handling"
+                self.say(f"   {relation} {self._link_text(link)}")
+
+    def _catch_text(self, stop):
+        catch = stop.catch
+        kind = catch.kind if catch is not None else "uncaught"
+        if kind == "caught" and catch.frame is not None:
+            return f"will be caught in {self._where(catch.frame)}"
+        if kind == "c-code":
+            return f"may be caught by C code called at {_show_path(catch.file)}:{catch.line}"
+        if kind == "with":
+            return f"a `with` at {_show_path(catch.file)}:{catch.line} may suppress it"
+        if self.session.prints_exceptions(stop.frame):
+            return "caught here and printed"
+        if stop.thread == threading.main_thread().ident:
+            return "not caught: the program ends with it"
+        return "not caught: the thread ends with it"
+
+    def _link_text(self, link):
+        """An exception of a chain in one line: what it is and where it was raised."""
+        text = _exception_text(type(link.exc), link.exc)
+        frame, line = link.raise_site
+        if frame is not None:
+            text += f"  (raised at {_show_path(frame.f_code.co_filename)}:{line} in " \
+                    f"{frame.f_code.co_name}())"
+        return text
 
     def _where(self, frame):
         place = self.session.place(frame)
@@ -328,8 +377,20 @@ class Console(cmd.Cmd, Frontend):
         session = self.session
         for frame in session.stack():
             mark = ">" if frame is session.frame else " "
-            self.say(f"{mark} {self._where(frame)}")
+            self.say(f"{mark} {self._where(frame)}{self._frame_note(frame)}")
             self.say(f"    -> {self._source(frame)}")
+
+    def _frame_note(self, frame):
+        """Marks a frame the exception has left, and the place it was raised when the
+        program stands elsewhere."""
+        session = self.session
+        notes = []
+        if session.is_finished(frame):
+            notes.append("finished")
+        stop = session.stop
+        if stop is not None and frame is session.raise_site() and frame is not stop.frame:
+            notes.append("raised here")
+        return f"  ({'; '.join(notes)})" if notes else ""
 
     do_w = do_bt = do_where
 
@@ -337,7 +398,7 @@ class Console(cmd.Cmd, Frontend):
         count = _int_arg(arg, "count") if arg.strip() else 1
         frame = self.session.move(direction * count)
         self._list_next = None
-        self.say(f"> {self._where(frame)}")
+        self.say(f"> {self._where(frame)}{self._frame_note(frame)}")
         self.say(f"-> {self._source(frame)}")
 
     def do_up(self, arg):
@@ -558,7 +619,12 @@ class Console(cmd.Cmd, Frontend):
     # ---- exceptions ------------------------------------------------------------------------
 
     def do_catch(self, arg):
-        """catch never|always|unhandled|printed: when exceptions stop the program.
+        """catch never|always|unhandled|user-unhandled|printed: when exceptions stop the
+        program. unhandled: where nothing will catch the exception (an exception that C
+        code or a `with` may still end stops in the first frame from which nothing can
+        catch it). user-unhandled: also where an exception leaves the program's own code
+        into library code that will catch it (the standard library, site-packages, and
+        the folders given with --library), as a test runner catches a failing test.
         catch always TYPE...: always stop on these types (unless the raising function
         catches them itself). catch never TYPE...: never stop on them.
         catch: show the settings."""
@@ -566,6 +632,9 @@ class Console(cmd.Cmd, Frontend):
         words = arg.split()
         if not words:
             self.say(f"exceptions stop: {session.exception_mode()}")
+            if session.exception_mode() == "user-unhandled":
+                self.say("library code: " + ", ".join(map(_show_path,
+                                                          session.library_paths)))
             self.say("always stop on: " + (_type_names(session.always_stop()) or "-"))
             self.say("never stop on: " + (_type_names(session.never_stop()) or "-"))
             return
@@ -579,8 +648,26 @@ class Console(cmd.Cmd, Frontend):
             session.set_never_stop(words[1:])
             self.say("never stop on: " + _type_names(session.never_stop()))
         else:
-            self.error("usage: catch [never|always|unhandled|printed] | catch always|never "
-                       "TYPE...")
+            self.error("usage: catch [never|always|unhandled|user-unhandled|printed] | "
+                       "catch always|never TYPE...")
+
+    def do_exceptions(self, arg):
+        """exceptions [NUMBER]: at an exception stop, list the exception and those it was
+        raised from or while handling (numbered from the oldest; `>` marks the one shown);
+        with a number, show that exception's frames (where, up, down, p) from where it was
+        raised. The frames an exception has left can be read, not changed."""
+        session = self.session
+        links, selected = session.exception_list()  # not at an exception stop: says so
+        if not arg.strip():
+            for number, link in enumerate(links):
+                mark = ">" if number == selected else " "
+                self.say(f"{mark} {number:>2} {self._link_text(link)}")
+            return
+        link, frame = session.select_exception(_int_arg(arg, "exceptions"))
+        self._list_next = None
+        self.say(f"!! {_exception_text(type(link.exc), link.exc)}")
+        self.say(f"> {self._where(frame)}{self._frame_note(frame)}")
+        self.say(f"-> {self._source(frame)}")
 
     def do_ignore_here(self, arg):
         """ignore-here: do not stop again on exceptions raised where the current one was."""
@@ -681,6 +768,7 @@ _SUMMARY = [
     ("ignore N COUNT", "pass a breakpoint COUNT times"),
     ("breakpoints", "list breakpoints and hits"),
     ("catch [MODE | always|never TYPE...]", "exception stops"),
+    ("exceptions [N]", "the exception's chain; show one"),
     ("ignore-here", "stop no more at this exception's place"),
     ("threads / thread N", "list threads, show one"),
     ("imports", "modules loaded since last asked"),

@@ -35,11 +35,11 @@ from dataclasses import dataclass, field
 
 import tvantrel30pydebugstackless as core
 
-from . import handlers
 from . import _ORIGINAL_IMPORT, _PROGRAM_HOOKS, HOOK_METHODS, check_hook
 from .catchinfo import DEFAULT_PRINTING_HANDLERS
 
-EXCEPTION_MODES = {"never": 0, "always": 1, "unhandled": 2, "printed": 4}
+EXCEPTION_MODES = {"never": 0, "always": 1, "unhandled": 2, "user-unhandled": 3,
+                   "printed": 4}
 # Exceptions that end a program normally or drive iteration: never stops, unless the mode is
 # "always" or the person lists them with `catch always`.
 DEFAULT_NEVER_STOP = (SystemExit, StopIteration, StopAsyncIteration, GeneratorExit)
@@ -74,10 +74,52 @@ class Stop:
     value: object = None  # the return value of a return stop
     exc: tuple = None  # (type, value, traceback) of an exception stop
     handler: object = None  # the frame predicted to catch the exception, or None
+    catch: object = None  # the core's prediction for the exception (a Catch), or None
     exiting: bool = False  # the exception leaves the program's outermost frame
     reason: str = None  # "breakpoint N", "interrupted", or None (stepping, start)
     deleted: list = field(default_factory=list)  # temporary breakpoints that fired
     inner: object = None  # the frame where the exception was raised
+    raise_line: int = 0  # the line of `inner` that raised it
+    finished: list = field(default_factory=list)  # frames below `frame` the exception left
+    chain: list = field(default_factory=list)  # ChainLink: the exception, then its causes
+
+
+@dataclass
+class Catch:
+    """What the core predicts for an exception at a stop. `kind` is "caught" (an except
+    clause of `frame` catches it, at `file`:`line`), "c-code" (C code called by `frame` at
+    `file`:`line` may end it), "with" (the `with` at `file`:`line` may suppress it) or
+    "uncaught"."""
+    kind: str
+    frame: object = None
+    file: str = None
+    line: int = 0
+
+
+@dataclass
+class ChainLink:
+    """One exception of a chain. `relation` says how it is linked to the exception before it
+    in the chain: None for the first (the exception of the stop), "cause" (`raise ... from`)
+    or "context" (raised while it was being handled)."""
+    exc: BaseException
+    relation: str = None
+    # Its traceback as the stop's event gave it: the exception being raised may not carry
+    # it yet (3.11 attaches it later). None: the exception's own.
+    tb: object = None
+
+    @property
+    def traceback(self):
+        return self.tb if self.tb is not None else getattr(self.exc, "__traceback__", None)
+
+    @property
+    def raise_site(self):
+        """(frame, line) where it was raised, from its traceback, or (None, 0)."""
+        tb = self.traceback
+        last = None
+        while tb is not None:
+            last = tb
+            tb = tb.tb_next
+        return (last.tb_frame, last.tb_lineno) if last is not None else (None, 0)
 
 
 @dataclass
@@ -145,7 +187,8 @@ def _own_files():
 
 class Session:
     def __init__(self, frontend, exceptions="unhandled", autoquit=True,
-                 debug_all_threads=True, skip_threads=(), catch_info=None, on_quit=None):
+                 debug_all_threads=True, skip_threads=(), catch_info=None, on_quit=None,
+                 library=()):
         self.frontend = frontend
         self.on_quit = on_quit or _exit_now
         self.own_files = _own_files()
@@ -174,6 +217,8 @@ class Session:
         self._at_prompt = False
         self._new_imports = []
         self.sub_language_hooks = []
+        self._clear_exception_view()
+        self.library_paths = library_paths(library)
         self._init_core(exceptions, autoquit, debug_all_threads)
         global _current
         _current = self
@@ -198,11 +243,20 @@ class Session:
             core.set_debug_thread_cb(self._debug_thread)
         core.set_never_stop_excepts(DEFAULT_NEVER_STOP)
         core.set_exc_catch_info_list(self.catch_info)
+        self._publish_library()
         # The threads' start-up code catches whatever escapes a thread's run() and prints
         # it: for the person debugging that is an unhandled exception.
         for function in (threading.Thread._bootstrap, threading.Thread._bootstrap_inner):
             self.ignored_codes.add(function.__code__)
         self._publish_ignored()
+
+    def _publish_library(self):
+        # The core compares file names with prefixes: a folder ends with its separator, so
+        # that "lib" does not take in "library.py" beside it. The debugger's own code is
+        # library code too (its runner must never count as the program's own).
+        prefixes = [path if os.path.isfile(path) else path.rstrip(os.sep) + os.sep
+                    for path in self.library_paths + [_HERE]]
+        core.analysis.set_user_code(prefixes)
 
     def ignore_handlers_of(self, *codes):
         """The handlers of these code objects (the debugger's own frames that run the
@@ -373,11 +427,16 @@ class Session:
         self.frame = stop.frame
         self.thread = stop.thread
         self._resume = None
+        if stop.kind == "exception":
+            self._selected_exception = len(stop.chain) - 1
+            self._show_exception(stop.chain[0])
+            self.frame = stop.frame  # the stop shows where the program stands
         try:
             self.frontend.stopped(self, stop)
         finally:
             self.stop = None
             self.frame = None
+            self._clear_exception_view()
         resume = self._resume or ("continue_run",)
         self._last_resume[stop.thread] = resume[0]
         if resume[0] == "quit":
@@ -385,6 +444,14 @@ class Session:
             self.on_quit()
             return
         getattr(core, resume[0])(*resume[1:])
+
+    def _clear_exception_view(self):
+        # Frames and exceptions of the program are not kept past the stop.
+        self._view = None
+        self._frame_lines = []
+        self._finished = []
+        self._finished_lines = {}
+        self._selected_exception = None
 
     def _is_internal(self, frame):
         return frame.f_code.co_filename in self.own_files
@@ -405,7 +472,8 @@ class Session:
             return True
         if mode == EXCEPTION_MODES["never"]:
             return False
-        return handlers.find_handler(stop.frame, exc_type, self.ignored_codes) is None
+        return self.predict_catch(stop.frame, stop.exc[1] if stop.exc[1] is not None
+                                  else exc_type).kind == "uncaught"
 
     def _apply_changed(self, changed, stop):
         """Brings the breakpoint table up to date; answers the breakpoint of this stop's line
@@ -436,16 +504,33 @@ class Session:
         return hit
 
     def _predict(self, stop):
-        exc_type, _value, tb = stop.exc
-        inner = stop.frame
-        while tb is not None:
-            inner = tb.tb_frame
-            tb = tb.tb_next
-        stop.handler = handlers.find_handler(stop.frame, exc_type, self.ignored_codes)
-        if stop.handler is not None and self._is_internal(stop.handler):
-            stop.handler = None
+        exc_type, value, tb = stop.exc
+        stop.catch = self.predict_catch(stop.frame, value if value is not None else exc_type)
+        if stop.catch.kind == "caught":
+            stop.handler = stop.catch.frame
         stop.exiting = bool(core.exiting_on_exception())
-        stop.inner = inner
+        entries = _traceback_entries(tb)
+        stop.inner, stop.raise_line = entries[-1] if entries else (stop.frame,
+                                                                   stop.frame.f_lineno)
+        below = _below(entries, stop.frame)
+        stop.finished = [frame for frame, _line in below if not self._is_internal(frame)]
+        self._finished_lines = dict(below)
+        stop.chain = exception_chain(value) or [ChainLink(value)]
+        stop.chain[0].tb = tb
+
+    def predict_catch(self, frame, exc):
+        """The core's answer to what will end `exc` raised in (or passing through) `frame`.
+        The debugger's own frames catch nothing of the program: an answer that points at
+        one means the exception is not caught. An answer the core cannot give (it failed)
+        counts as not caught, as the core counts it when it decides whether to stop."""
+        try:
+            kind, catcher, file, line = core.analysis.predict_catch(frame, exc)
+        except Exception:
+            return Catch("uncaught")
+        if kind == "caught" and catcher is None or \
+                catcher is not None and self._is_internal(catcher):
+            return Catch("uncaught")
+        return Catch(kind, catcher, file, line)
 
     # ---- resume commands (a front end calls one, then returns from stopped()) -------------
 
@@ -503,6 +588,8 @@ class Session:
         stop = self.stop
         if stop is None:
             raise SessionError("the program is not stopped")
+        if self.is_finished(self.frame):
+            raise SessionError("cannot jump in a finished frame (the exception has left it)")
         if self.frame is not stop.frame:
             where = ("go back there with `down`" if self._is_caller(self.frame, stop.frame)
                      else "select it with `thread` and `down`")
@@ -536,7 +623,13 @@ class Session:
 
     def stack(self, frame=None):
         """The program's frames from the outermost to `frame` (default: the thread's
-        innermost), without the debugger's own."""
+        innermost), without the debugger's own. At an exception stop of the thread shown,
+        the default is the frames of the exception selected (`select_exception`): for the
+        stop's own exception, the stack and below it the frames the exception has left (to
+        where it was raised); for an exception of its chain, its traceback's frames."""
+        if frame is None and self._view is not None and self.stop is not None \
+                and self.thread == self.stop.thread:
+            return list(self._view)
         frame = frame if frame is not None else self._innermost()
         frames = []
         while frame is not None:
@@ -566,6 +659,82 @@ class Session:
         while frame is not None and self.frame_category(frame, ident) == IMPLEMENTATION_FRAME:
             frame = frame.f_back
         return frame
+
+    def is_finished(self, frame):
+        """Whether `frame` is one the exception shown has left (or a frame of a chained
+        exception's traceback that no longer runs): it can be read, not changed."""
+        return frame is not None and any(frame is known for known in self._finished)
+
+    def frame_line(self, frame):
+        """The line a frame stands at as shown: for a frame of an exception's traceback, the
+        line the exception passed through there."""
+        for known, line in self._frame_lines:
+            if known is frame:
+                return line
+        return frame.f_lineno
+
+    def _exception_stop(self):
+        stop = self.stop
+        if stop is None or stop.kind != "exception":
+            raise SessionError("not stopped at an exception")
+        return stop
+
+    def exception_list(self):
+        """The exceptions of the stop's chain, the oldest first (its last item is the
+        exception of the stop), and the number of the one selected."""
+        stop = self._exception_stop()
+        links = list(reversed(stop.chain))
+        return links, self._selected_exception
+
+    def raise_site(self):
+        """The frame where the exception shown was raised, or None."""
+        stop = self.stop
+        if stop is None or stop.kind != "exception" or self._selected_exception is None:
+            return None
+        links = list(reversed(stop.chain))
+        if self._selected_exception == len(links) - 1:
+            return stop.inner
+        return links[self._selected_exception].raise_site[0]
+
+    def select_exception(self, number):
+        """Shows the frames of exception `number` of `exception_list()`, selecting the frame
+        where it was raised; answers (its ChainLink, that frame)."""
+        stop = self._exception_stop()
+        links = list(reversed(stop.chain))
+        if not 0 <= number < len(links):
+            last = len(links) - 1
+            raise SessionError(f"no exception {number}: "
+                               + ("the only one is 0" if last == 0 else
+                                  f"they are numbered 0 to {last}"))
+        self.thread = stop.thread
+        self._selected_exception = number
+        self._show_exception(links[number])
+        return links[number], self.frame
+
+    def _show_exception(self, link):
+        """Makes the frames of `link`'s exception the ones shown, its raise site selected."""
+        stop = self.stop
+        live = self.stack(stop.frame)
+        if link is stop.chain[0]:
+            frames = live + stop.finished
+            lines = self._finished_lines
+        else:
+            traced = [(frame, line) for frame, line in _traceback_entries(link.traceback)
+                      if not self._is_internal(frame)
+                      and self.frame_category(frame) != IMPLEMENTATION_FRAME]
+            frames = [frame for frame, _line in traced]
+            # Where the traceback starts in a frame that still runs, its callers are shown
+            # too: they are where the program is.
+            if frames and any(frames[0] is frame for frame in live):
+                index = next(i for i, frame in enumerate(live) if frame is frames[0])
+                frames = live[:index] + frames
+            lines = dict(traced)
+        self._view = frames
+        self._frame_lines = list(lines.items())
+        self._finished = [frame for frame in frames if not any(frame is f for f in live)]
+        raised = link.raise_site[0] if link is not stop.chain[0] else stop.inner
+        self.frame = next((frame for frame in frames if frame is raised),
+                          frames[-1] if frames else stop.frame)
 
     def move(self, count):
         """Selects the frame `count` levels out (positive) or in (negative)."""
@@ -795,7 +964,7 @@ class Session:
         if place.sub_language:  # the core filters a key frame's exceptions by its translation
             path, line = place.file, place.line
         else:
-            path, line = core.get_frame_file(inner), inner.f_lineno
+            path, line = core.get_frame_file(inner), stop.raise_line
         core.ignore_exception_loc(path, line, 1)
         return path, line
 
@@ -824,6 +993,9 @@ class Session:
         if self._key_hook(frame) is not None:
             raise SessionError("statements cannot run in a sub-language's variables; "
                                "`p EXPRESSION` evaluates there")
+        if self.is_finished(frame):
+            raise SessionError("cannot change a finished frame (the exception has left it); "
+                               "expressions can still be evaluated in it")
         globals_, locals_ = self.namespaces(frame)
         code = compile(statement + "\n", "<selvane>", "single")
         try:
@@ -902,7 +1074,7 @@ class Session:
                 return Place(str(file), int(line))
             except Exception:
                 pass
-        return Place(frame.f_code.co_filename, frame.f_lineno, frame.f_code.co_name)
+        return Place(frame.f_code.co_filename, self.frame_line(frame), frame.f_code.co_name)
 
     def source(self, frame, line=None):
         """The text of the frame's line (or of another line of its file), stripped, or
@@ -943,6 +1115,72 @@ class Session:
 
     def take_new_imports(self):
         return list(core.get_new_imports())
+
+
+def library_paths(extra=()):
+    """The folders (or files) whose code is library code rather than the program's own: the
+    interpreter's standard library, the site-packages folders, the user's site-packages, and
+    `extra` (paths the person gives, relative to the working directory). Each is given as
+    written and as its real path, since a code object's file name may carry either."""
+    found = [os.path.dirname(os.__file__)]
+    site = sys.modules.get("site")  # loaded at start-up unless the interpreter ran with -S
+    try:
+        found.extend(site.getsitepackages())
+    except Exception:
+        pass
+    # Read, not asked for: site.getusersitepackages() would set the module's USER_SITE
+    # where the interpreter left it unset (-s), which the program could see.
+    user_site = getattr(site, "USER_SITE", None)
+    if isinstance(user_site, str):
+        found.append(user_site)
+    for path in extra:
+        if not os.path.exists(path):
+            raise SessionError(f"no file or folder {path!r}")
+        found.append(path)
+    paths = []
+    for path in found:
+        for form in (os.path.abspath(path), os.path.realpath(path)):
+            if form not in paths:
+                paths.append(form)
+    return paths
+
+
+def _traceback_entries(tb):
+    """(frame, line) of each entry of a traceback, the outermost first."""
+    entries = []
+    while tb is not None and len(entries) < _MAX_TRACEBACK:
+        entries.append((tb.tb_frame, tb.tb_lineno))
+        tb = tb.tb_next
+    return entries
+
+
+_MAX_TRACEBACK = 10000
+
+
+def _below(entries, frame):
+    """The traceback entries below the last entry of `frame`: the frames an exception
+    reported in `frame` has already left, down to where it was raised."""
+    last = max((i for i, (known, _line) in enumerate(entries) if known is frame), default=None)
+    return entries[last + 1:] if last is not None else []
+
+
+def exception_chain(exc):
+    """The exception and those it was raised from (`__cause__`) or while handling
+    (`__context__`, unless suppressed), as the interpreter prints them: a ChainLink each,
+    the exception itself first."""
+    links = []
+    seen = set()
+    relation = None
+    while isinstance(exc, BaseException) and id(exc) not in seen and len(links) < 100:
+        seen.add(id(exc))
+        links.append(ChainLink(exc, relation))
+        if exc.__cause__ is not None:
+            exc, relation = exc.__cause__, "cause"
+        elif exc.__context__ is not None and not exc.__suppress_context__:
+            exc, relation = exc.__context__, "context"
+        else:
+            break
+    return links
 
 
 def _is_python_file(path):

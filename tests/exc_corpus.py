@@ -13,6 +13,11 @@ caught?" at the moment of the raise can be checked against that truth:
 ``corpus()`` yields richer records (name, category, text, every raise with its truth).
 Categories: "plain" shapes the analysis must get right; "unknown" shapes it deliberately
 does not read (a call in the class expression), whose predictions are only counted.
+``boundary_corpus()`` yields programs of the category "boundary": C code between Python
+frames (getattr with a default, hasattr, sorted with a key, map, the old sequence protocol)
+and `with` blocks (contextlib.suppress, a @contextmanager generator that catches, an exit
+that swallows everything, one that lets everything go). At the raise the analysis may only
+say "may be caught" there; the stop decision must still fire exactly for the escaping ones.
 
 Run as a script to print the truth statistics of the corpus for this interpreter.
 """
@@ -244,6 +249,85 @@ class _Builder:
         raise ValueError(kind)
 
 
+BOUNDARY_PRELUDE = '''
+import contextlib
+class Swallow:
+    def __enter__(self):
+        return self
+    def __exit__(self, *exc_info):
+        return True
+@contextlib.contextmanager
+def catching(*types):
+    try:
+        yield
+    except types:
+        pass
+def via_getattr(fn):
+    class G:
+        def __getattr__(self, name):
+            fn()
+            return 1
+    return getattr(G(), "x", None)
+def via_hasattr(fn):
+    class H:
+        @property
+        def x(self):
+            fn()
+            return 1
+    return hasattr(H(), "x")
+def via_sorted(fn):
+    return sorted([2, 1], key=lambda item: fn())
+def via_map(fn):
+    return list(map(lambda item: fn(), [0]))
+class OldSeq:
+    def __init__(self, fn):
+        self.fn = fn
+    def __getitem__(self, index):
+        if index:
+            raise IndexError(index)
+        self.fn()
+        return 0
+def via_old_seq(fn):
+    return list(OldSeq(fn))
+'''
+
+BOUNDARY_RAISED = RAISED_CLASSES + ["AttributeError", "IndexError"]
+BOUNDARY_TYPES = ["Leaf", "Mid", "Other", "KeyError", "AttributeError", "IndexError",
+                  "LookupError", "Exception"]
+BOUNDARY_LAYERS = ["try", "with", "suppress", "contextmanager", "swallow", "finally"]
+C_BOUNDARIES = ["getattr", "hasattr", "sorted", "map", "old_seq", "call"]
+
+
+class _BoundaryBuilder(_Builder):
+    """Builds one program whose raise passes C code and `with` blocks."""
+
+    def types(self):
+        return ", ".join(self.rng.sample(BOUNDARY_TYPES, self.rng.choice([1, 1, 2])))
+
+    def build(self):
+        rng = self.rng
+        tag = self.tag()
+        body = ["raise mark(%s(%r), %r)" % (rng.choice(BOUNDARY_RAISED), tag, tag)]
+        for _ in range(rng.randint(1, 5)):
+            if rng.random() < 0.5:
+                body = self.boundary_layer(rng.choice(BOUNDARY_LAYERS), body)
+            else:
+                name = self.close_function(body, False, False)
+                via = rng.choice(C_BOUNDARIES)
+                body = ["%s()" % name] if via == "call" else ["via_%s(%s)" % (via, name)]
+        main = "def main():\n" + "\n".join(_indent(body))
+        return "\n\n".join([PRELUDE + BOUNDARY_PRELUDE] + self.functions + [main, "main()\n"])
+
+    def boundary_layer(self, kind, body):
+        if kind == "suppress":
+            return ["with contextlib.suppress(%s):" % self.types()] + _indent(body)
+        if kind == "contextmanager":
+            return ["with catching(%s):" % self.types()] + _indent(body)
+        if kind == "swallow":
+            return ["with Swallow():"] + _indent(body)
+        return self.same_frame_layer(kind, body)
+
+
 def programs(count=600, seed=20240611):
     """Yields (name, category, text) for `count` generated programs."""
     rng = random.Random(seed)
@@ -270,6 +354,15 @@ def corpus(count=600, seed=20240611):
     """Yields (name, category, text, raises) with raises = [(seq, tag, escaped)]."""
     for name, category, text in programs(count, seed):
         yield name, category, text, run_untraced(text)
+
+
+def boundary_corpus(count=200, seed=20261125):
+    """Yields (name, "boundary", text, raises) as corpus() does, for programs whose raises
+    pass C code and `with` blocks."""
+    rng = random.Random(seed)
+    for index in range(count):
+        text = _BoundaryBuilder(rng, "boundary").build()
+        yield "b%04d" % index, "boundary", text, run_untraced(text)
 
 
 def cases(count=600, seed=20240611):

@@ -3,7 +3,10 @@ mode 2 (stop on unhandled exceptions), all in this one process, and writes, per 
 raises that really escaped (learnt by running it untraced first) and the raises for which the
 exception callback ran.
 
-Usage: python exc_corpus_run.py OUT.json [COUNT]
+Usage: python exc_corpus_run.py OUT.json [COUNT [BOUNDARY_COUNT]]
+
+After the COUNT programs of the corpus come BOUNDARY_COUNT (default 0) programs whose
+raises pass C code and `with` blocks (exc_corpus.boundary_corpus).
 
 The runner's own frame catches whatever leaves a program; it is registered as an ignored
 handler, as a debugger registers its own frames, so that an escaping exception counts as
@@ -11,6 +14,7 @@ unhandled. Only the corpus's numbered raises are counted.
 """
 
 import builtins
+import itertools
 import json
 import sys
 import threading
@@ -42,13 +46,15 @@ def run_one(code):
         pass
 
 
-def main(out, count):
+def main(out, count, boundary_count=0):
     core.init(0.0, 2, lambda flag: threading.settrace(core.bootstrap_new_thread if flag else None),
               lambda: None, step, step, exception_cb, lambda: None, None, ORIGINAL_IMPORT, None,
               {})
     core.set_ignored_exception_handlers({run_one.__code__: 1})
     results = []
-    for name, category, text, raises in exc_corpus.corpus(count):
+    programs = itertools.chain(exc_corpus.corpus(count),
+                               exc_corpus.boundary_corpus(boundary_count))
+    for name, category, text, raises in programs:
         code = compile(text, "<corpus>", "exec")
         fired.clear()
         core.continue_run()
@@ -64,4 +70,5 @@ def main(out, count):
 
 
 if __name__ == "__main__":
-    main(sys.argv[1], int(sys.argv[2]) if len(sys.argv) > 2 else 600)
+    main(sys.argv[1], int(sys.argv[2]) if len(sys.argv) > 2 else 600,
+         int(sys.argv[3]) if len(sys.argv) > 3 else 0)

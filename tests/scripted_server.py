@@ -343,6 +343,9 @@ def main(config_path):
         core.set_autoquit(int(config["autoquit"]))
     if server.thread_policy is not None:
         core.set_debug_thread_cb(server.debug_thread_cb)
+    # Like a debugger's own runner, the frame that runs the program is marked: its handlers,
+    # and every `with` block and call into C from it outward, are not the program's.
+    core.set_ignored_exception_handlers({runpy._run_code.__code__: 1})
     if "prelude" in config:
         exec(config["prelude"], {"core": core, "shared": shared, "threading": threading})
     for spec in config.get("sub_languages", []):

@@ -430,3 +430,35 @@ def test_imports_lists_new_modules(tmp_path):
         dbg.finish("c")
     finally:
         dbg.close()
+
+
+def test_the_console_stays_on_the_terminal_when_the_program_moves_its_descriptors(tmp_path):
+    # As pytest's output capture does: descriptors 1 and 0 pointed at files (and sys.stdout
+    # replaced). The console still reads and writes the terminal; the program's output goes
+    # where it put it.
+    write(tmp_path, "prog.py", """
+        import io
+        import os
+        import sys
+
+        out = os.open("captured.txt", os.O_WRONLY | os.O_CREAT | os.O_TRUNC)
+        os.dup2(out, 1)
+        os.dup2(os.open(os.devnull, os.O_RDONLY), 0)
+        sys.stdout = io.TextIOWrapper(os.fdopen(1, "wb", closefd=False), line_buffering=True)
+        print("to the file")
+        value = 42
+        print("value", value)
+    """)
+    dbg = Session.debug(tmp_path, "--break", "prog.py:11", "prog.py")
+    try:
+        dbg.prompt()
+        out = dbg.do("c")
+        assert stop_line(out) == "> prog.py:11 in <module>()  (breakpoint 1)"
+        assert dbg.do("p value") == "42\n"
+        out, status = dbg.finish("c")
+        assert "to the file" not in out and "value 42" not in out
+        assert "The program exited with status 0." in out
+        assert status == 0
+    finally:
+        dbg.close()
+    assert (tmp_path / "captured.txt").read_text() == "to the file\nvalue 42\n"

@@ -34,19 +34,139 @@ PyObject* value_of(PyObject* exc_arg) {
   return PyTuple_GET_SIZE(exc_arg) > 1 ? PyTuple_GET_ITEM(exc_arg, 1) : Py_None;
 }
 
-// Rule: an exception in the thread's bottom frame that nothing there can catch ends the
-// program. Stop, and let the server side know it can close its connection cleanly.
-bool leaves_bottom_frame(PyObject* frame) {
-  if (!compat::is_plain_frame(frame)) return false;
+ThreadData* this_thread_data() {
   ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
-  if (data == nullptr) {
-    PyErr_Clear();
+  if (data == nullptr) PyErr_Clear();
+  return data;
+}
+
+// The traceback of an event's argument: the exception object does not always carry it yet
+// when the event is reported (3.11). Borrowed; null when there is none.
+PyObject* traceback_of(PyObject* exc_arg) {
+  if (!PyTuple_Check(exc_arg) || PyTuple_GET_SIZE(exc_arg) < 3) return nullptr;
+  PyObject* tb = PyTuple_GET_ITEM(exc_arg, 2);
+  return PyTraceBack_Check(tb) ? tb : nullptr;
+}
+
+const void* code_of(PyObject* frame) {
+  if (!compat::is_plain_frame(frame)) return nullptr;
+  Ref code = Ref::steal(
+      reinterpret_cast<PyObject*>(PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(frame))));
+  return code.get();  // only compared; the frame keeps its code alive
+}
+
+// Whether the thread already stopped on this exception because nothing would catch it: the
+// same object, whose traceback still passes through the frame of that stop, running the
+// same code. (The traceback keeps that frame alive as long as the exception lives, so a
+// new exception at a reused address does not pass this test by a reused frame alone.)
+bool stopped_on_before(const ThreadData* data, PyObject* exc, PyObject* traceback) {
+  if (data->unhandled_stop_exc != exc || !PyExceptionInstance_Check(exc)) return false;
+  Ref entry = Ref::borrow(traceback);
+  for (int depth = 0; entry && PyTraceBack_Check(entry.get()) && depth < 100000; ++depth) {
+    auto* tb = reinterpret_cast<PyTracebackObject*>(entry.get());
+    PyObject* frame = reinterpret_cast<PyObject*>(tb->tb_frame);
+    if (frame == data->unhandled_stop_frame) return code_of(frame) == data->unhandled_stop_code;
+    entry = Ref::borrow(reinterpret_cast<PyObject*>(tb->tb_next));
+  }
+  return false;
+}
+
+// Stops once per exception: the first frame that finds it unhandled takes it.
+bool first_unhandled_stop(ThreadData* data, PyObject* frame, PyObject* exc, PyObject* traceback) {
+  if (data == nullptr) return true;
+  if (stopped_on_before(data, exc, traceback)) {
+    do_dprintf(kDbgFlow, "  already stopped on\n");
     return false;
   }
+  data->unhandled_stop_exc = exc;
+  data->unhandled_stop_frame = frame;
+  data->unhandled_stop_code = code_of(frame);
+  return true;
+}
+
+// Rule: an exception in the thread's bottom frame that nothing there can catch ends the
+// program. Stop (unless an inner frame already stopped on it), and let the server side know
+// it can close its connection cleanly.
+bool leaves_bottom_frame(PyObject* frame, PyObject* exc, PyObject* traceback) {
+  if (!compat::is_plain_frame(frame)) return false;
+  ThreadData* data = this_thread_data();
+  if (data == nullptr) return false;
   if (!data->bot_frame.is(frame) || frame_has_active_handler(frame)) return false;
   do_dprintf(kDbgFlow, "  leaving bottom frame\n");
   data->leaving_bot_frame = 1;
+  return first_unhandled_stop(data, frame, exc, traceback);
+}
+
+// The question for the handler analysis: from `frame` outward to the thread's bottom frame
+// (the frames below it are the debugger's own).
+CatchPrediction predict_from(PyObject* frame, PyObject* exc, const ThreadData* data, bool leaving) {
+  CatchQuestion question;
+  question.leaving_frame = leaving;
+  question.frame = frame;
+  question.exc = exc;
+  question.ignored_handlers = gSelf.ignored_exception_handlers.get();
+  question.match_kind = kMatchGiven;
+  if (data != nullptr && data->bot_frame && !data->bot_frame.is_none())
+    question.outermost = data->bot_frame.get();
+  return predict_catch(question);
+}
+
+// Rule (mode 3): the exception leaves the program's own code here, and library code will
+// end it (or may: C code or a `with` of library code).
+bool leaves_user_code_into_library(PyObject* frame, const CatchPrediction& prediction) {
+  if (prediction.kind == CatchKind::kUncaught) return false;
+  const UserCode* user_code = &gSelf.user_code;
+  return !frame_is_library_code(user_code, frame) &&
+         frame_is_library_code(user_code, prediction.frame.get());
+}
+
+// Rules of modes 2 and 3. Where only C code or a `with` exit may end the exception, this
+// event does not stop: the exception events of the outer frames, as it reaches them, decide
+// again, so that a truly unhandled one stops in the first frame nothing can catch it from.
+bool stops_as_unhandled(PyObject* frame, PyObject* exc, PyObject* traceback, bool leaving) {
+  enter_debugger();
+  ThreadData* data = this_thread_data();
+  CatchPrediction prediction = predict_from(frame, exc, data, leaving);
+  if (data != nullptr && !leaving)
+    data->with_may_suppress_in = prediction.kind == CatchKind::kWith ? frame : nullptr;
+  bool stop = prediction.kind == CatchKind::kUncaught;
+  if (!stop && gSelf.exception_mode == kExcUserUnhandledStop)
+    stop = leaves_user_code_into_library(frame, prediction);
+  return stop && first_unhandled_stop(data, frame, exc, traceback);
+}
+
+// Modes 2 and 3, when a frame is left by an exception that a `with` exit might have ended at
+// its latest exception event: that exit let it go (no event reports a re-raise), so the
+// frame, still alive, decides again before it is gone. Other frames need not: the caller's
+// exception event comes next and decides. The bottom frame always does (no caller of the
+// program's comes), also when other exceptions meanwhile replaced the note.
+bool leaves_frame_unhandled(PyObject* frame, PyObject* exc_arg) {
+  int mode = gSelf.exception_mode;
+  if (mode != kExcUnhandledStop && mode != kExcUserUnhandledStop) return false;
+  ThreadData* data = this_thread_data();
+  if (data == nullptr || (data->with_may_suppress_in != frame && !data->bot_frame.is(frame)))
+    return false;
+  data->with_may_suppress_in = nullptr;
+  if (!PyTuple_Check(exc_arg) || PyTuple_GET_SIZE(exc_arg) < 2) return false;
+  PyObject* exc = value_of(exc_arg);
+  if (!PyExceptionInstance_Check(exc) || matches_list(exc, gSelf.never_stop_excepts)) return false;
+  PyObject* traceback = traceback_of(exc_arg);
+  if (stopped_on_before(data, exc, traceback)) return false;
+  if (!stops_as_unhandled(frame, exc, traceback, true)) return false;
+  if (data->bot_frame.is(frame)) data->leaving_bot_frame = 1;
   return true;
+}
+
+// The stop made as a frame is left: the server side's questions about this frame are told
+// that it is being left.
+int stop_on_leaving_frame(PyObject* frame, PyObject* recorded_exc_arg) {
+  Ref arg = Ref::borrow(recorded_exc_arg);  // held: the callback may drop its record
+  ThreadData* data = this_thread_data();
+  if (data != nullptr) data->exception_leaving_frame = frame;
+  int result = do_exception_callback_if_not_filtered(frame, arg.get());
+  data = this_thread_data();  // the callback may have reset the thread table
+  if (data != nullptr) data->exception_leaving_frame = nullptr;
+  return result;
 }
 
 // The place where the exception really happened: the innermost frame of its traceback.
@@ -155,9 +275,10 @@ int stop_at_exception_no_filters(PyObject* frame, PyObject* exc_type, PyObject* 
     do_dprintf(kDbgFlow, "  never stop\n");
     return 0;
   }
-  if (leaves_bottom_frame(frame)) return 1;
   // The instance where the event carries one (always, on current interpreters), else the type.
   PyObject* exc = value_of(exc_arg) != Py_None ? value_of(exc_arg) : exc_type;
+  PyObject* traceback = traceback_of(exc_arg);
+  if (leaves_bottom_frame(frame, exc, traceback)) return 1;
   PyObject* ignored = s.ignored_exception_handlers.get();
   // The handler analysis and the catch-info list may run Python code (the class expressions
   // of except clauses, the instances' attributes): the thread enters the debugger first.
@@ -169,9 +290,8 @@ int stop_at_exception_no_filters(PyObject* frame, PyObject* exc_type, PyObject* 
       return 1;
     }
   }
-  if (s.exception_mode == kExcUnhandledStop) {
-    enter_debugger();
-    if (!__tracer_exc_handled(frame, ignored, exc, kMatchGiven, 0)) {
+  if (s.exception_mode == kExcUnhandledStop || s.exception_mode == kExcUserUnhandledStop) {
+    if (stops_as_unhandled(frame, exc, traceback, false)) {
       do_dprintf(kDbgFlow, "  unhandled\n");
       return 1;
     }
@@ -213,6 +333,8 @@ int dispatch_exception_return(PyObject* frame, PyObject* recorded_exc_arg) {
     Ref arg = recorded_exc_arg != nullptr ? Ref::borrow(recorded_exc_arg) : handled_exception_arg();
     if (!arg) return -1;
     result = do_exception_callback_if_not_filtered(frame, arg.get());
+  } else if (recorded_exc_arg != nullptr && leaves_frame_unhandled(frame, recorded_exc_arg)) {
+    result = stop_on_leaving_frame(frame, recorded_exc_arg);
   }
   ThreadData* data = current_thread_data_or_insert(&gSelf.thread_table);
   if (data == nullptr) {

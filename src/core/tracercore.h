@@ -16,6 +16,7 @@
 #include "bp/bpops.h"
 #include "core/sublang.h"
 #include "exc/exceptops.h"
+#include "exc/usercode.h"
 #include "names/conames.h"
 #include "support/hashtable.h"
 #include "support/ref.h"
@@ -24,6 +25,9 @@ enum ExceptionMode : int {
   kExcNeverStop = 0,
   kExcAlwaysStop = 1,
   kExcUnhandledStop = 2,
+  // Also stops where an exception leaves the program's own code into library code that ends
+  // it (a test failing under a test runner that catches everything).
+  kExcUserUnhandledStop = 3,
 };
 
 // selvane_mutex_owner when nobody holds the mutex.
@@ -87,6 +91,7 @@ struct TracerState {
   uint32_t import_hook_calls = 0;
   pid_t pid = 0;
   ExcData exc_data;
+  UserCode user_code;  // which code is library code, for kExcUserUnhandledStop
   int pending_exception_count = 0;
   // Set on the first event seen in a forked child of the process that called init: nothing
   // is traced there. Learnt from a fork handler, so the hot path never asks for the pid.

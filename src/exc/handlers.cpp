@@ -365,15 +365,28 @@ bool any_item_matches(const ClauseItems& clause, PyObject* exc, PyObject* exc_ty
 
 // ---- Handler chains -----------------------------------------------------------------------
 
-enum class Verdict { kNotCaught, kCaught };
+enum class Verdict {
+  kNotCaught,
+  kCaught,
+  kMayBeSuppressed,  // a `with` whose exit may suppress it, and we cannot tell
+};
+
+// What one frame does with the exception, and where in its code.
+struct FrameVerdict {
+  Verdict verdict = Verdict::kNotCaught;
+  int offset = -1;  // the catching clause, the `with` exit handler; -1: none
+  Ref frame;        // the frame that decides: the analysed one, or a context manager's
+};
 
 // A chain of `except` clauses starting at `pos` (just after PUSH_EXC_INFO).
-Verdict except_chain(const FrameCode& fc, Namespaces& ns, int pos, const Query& q) {
+Verdict except_chain(const FrameCode& fc, Namespaces& ns, int pos, const Query& q,
+                     int* clause_offset) {
   for (int index = 0; index < kMaxClauses; ++index) {
     Instr ins;
     if (!fc.decode(pos, &ins)) return Verdict::kNotCaught;
     if (is(ins.op, bytecode::kPopTop)) {
       do_dprintf(kDbgExceptions, "  bare except at %d\n", ins.offset);
+      *clause_offset = ins.offset;
       return q.kind == kMatchGiven ? Verdict::kCaught : Verdict::kNotCaught;
     }
     if (is(ins.op, bytecode::kReraise)) return Verdict::kNotCaught;  // no clause matched
@@ -396,6 +409,7 @@ Verdict except_chain(const FrameCode& fc, Namespaces& ns, int pos, const Query& 
     }
     if (any_item_matches(clause, q.exc, q.type, q.kind)) {
       do_dprintf(kDbgExceptions, "  clause at %d matches\n", shape.expr);
+      *clause_offset = shape.check;
       return Verdict::kCaught;
     }
     pos = shape.next;
@@ -482,8 +496,107 @@ int except_star_start(const FrameCode& fc, int pos) {
   return saw_list ? pos : -1;
 }
 
-// Decides what the handler at `target` does with the exception.
-Verdict handler_at(const FrameCode& fc, Namespaces& ns, int target, const Query& q) {
+bool exc_matches(PyObject* exc, PyObject* cls) {
+  return PyErr_GivenExceptionMatches(exc, cls) != 0;
+}
+
+PyFrameObject* as_frame(PyObject* obj) {
+  return reinterpret_cast<PyFrameObject*>(obj);
+}
+
+FrameVerdict frame_verdict(PyFrameObject* frame, const Query& q, int nesting);
+
+// ---- `with` blocks ------------------------------------------------------------------------
+//
+// A `with` exit may suppress the exception by returning true. Two context managers of the
+// standard library are read exactly, from the objects' own attributes (their classes define
+// no descriptors for them, so no code of the program runs): contextlib.suppress, and the
+// manager of a @contextmanager generator, whose suspended frame is analysed at its yield, as
+// the exception will be thrown in there. Every other exit may suppress it: we cannot know
+// without calling it.
+
+constexpr int kMaxManagerNesting = 8;  // generators managing generators
+
+// An attribute of an already imported module, read from the module's dictionary: nothing is
+// imported and no code runs. Borrowed; null when the module or the name is not there.
+PyObject* loaded_module_attr(const char* module, const char* name) {
+  PyObject* modules = PyImport_GetModuleDict();
+  if (modules == nullptr || !PyDict_Check(modules)) return nullptr;
+  PyObject* mod = PyDict_GetItemString(modules, module);
+  if (mod == nullptr || !PyModule_Check(mod)) return nullptr;
+  PyObject* dict = PyModule_GetDict(mod);
+  return dict != nullptr ? PyDict_GetItemString(dict, name) : nullptr;
+}
+
+bool has_exact_type(PyObject* obj, PyObject* type) {
+  return type != nullptr && reinterpret_cast<PyObject*>(Py_TYPE(obj)) == type;
+}
+
+// An instance attribute of a standard-library object of exactly its class.
+Ref instance_attr(PyObject* obj, const char* name) {
+  Ref key = Ref::steal(PyUnicode_FromString(name));
+  if (!key) return Ref();
+  return Ref::steal(PyObject_GenericGetAttr(obj, key.get()));
+}
+
+bool is_group(PyObject* exc) {
+  return PyObject_TypeCheck(exc, reinterpret_cast<PyTypeObject*>(PyExc_BaseExceptionGroup));
+}
+
+// contextlib.suppress(*types): suppresses what matches one of its types. A group that does
+// not match as a whole may be split by it: uncertain.
+Verdict suppress_verdict(PyObject* manager, const Query& q) {
+  Ref types = instance_attr(manager, "_exceptions");
+  if (!types || !PyTuple_Check(types.get())) return Verdict::kMayBeSuppressed;
+  ClauseItems items;
+  items.items = reinterpret_cast<PyTupleObject*>(types.get())->ob_item;
+  items.count = PyTuple_GET_SIZE(types.get());
+  for (Py_ssize_t i = 0; i < items.count; ++i) {
+    if (!PyExceptionClass_Check(items.items[i])) return Verdict::kMayBeSuppressed;
+  }
+  if (any_item_matches(items, q.exc, q.type, q.kind)) return Verdict::kCaught;
+  return is_group(q.exc) ? Verdict::kMayBeSuppressed : Verdict::kNotCaught;
+}
+
+// The manager of a @contextmanager generator throws the exception into the generator at its
+// yield and suppresses it when the generator catches it. A StopIteration gets special
+// treatment there, and a generator that is not suspended cannot be read: uncertain.
+Verdict generator_manager_verdict(PyObject* manager, const Query& q, int nesting,
+                                  FrameVerdict* inner) {
+  if (nesting >= kMaxManagerNesting || exc_matches(q.exc, PyExc_StopIteration))
+    return Verdict::kMayBeSuppressed;
+  Ref gen = instance_attr(manager, "gen");
+  if (!gen || !PyGen_CheckExact(gen.get())) return Verdict::kMayBeSuppressed;
+  Ref suspended = Ref::steal(PyObject_GetAttrString(gen.get(), "gi_suspended"));
+  Ref frame = Ref::steal(PyObject_GetAttrString(gen.get(), "gi_frame"));
+  if (!suspended || suspended.get() != Py_True || !frame || !compat::is_plain_frame(frame.get()))
+    return Verdict::kMayBeSuppressed;
+  FrameVerdict verdict = frame_verdict(as_frame(frame.get()), q, nesting + 1);
+  // Not caught in the generator: the manager's exit lets the same exception go on.
+  if (verdict.verdict == Verdict::kNotCaught) return Verdict::kNotCaught;
+  *inner = std::move(verdict);
+  return inner->verdict;
+}
+
+// The `with` block whose exit handler `entry` leads to, in `frame`.
+Verdict with_exit_verdict(PyFrameObject* frame, const TableEntry& entry, const Query& q,
+                          int nesting, FrameVerdict* inner) {
+  PyObject* manager = compat::with_manager_of(frame, entry.depth);
+  if (manager == nullptr) return Verdict::kMayBeSuppressed;
+  if (has_exact_type(manager, loaded_module_attr("contextlib", "suppress")))
+    return suppress_verdict(manager, q);
+  if (has_exact_type(manager, loaded_module_attr("contextlib", "_GeneratorContextManager")))
+    return generator_manager_verdict(manager, q, nesting, inner);
+  return Verdict::kMayBeSuppressed;
+}
+
+// ---- One frame ------------------------------------------------------------------------------
+
+// Decides what the handler of `entry` does with the exception; `out` receives where.
+Verdict handler_at(PyFrameObject* frame, const FrameCode& fc, Namespaces& ns,
+                   const TableEntry& entry, const Query& q, int nesting, FrameVerdict* out) {
+  int target = entry.target;
+  out->offset = target;
   Instr ins;
   if (!fc.decode(target, &ins)) return Verdict::kNotCaught;
   if (is(ins.op, bytecode::kEndAsyncFor)) {
@@ -499,34 +612,39 @@ Verdict handler_at(const FrameCode& fc, Namespaces& ns, int target, const Query&
   if (!fc.decode(ins.next, &first)) return Verdict::kNotCaught;
   if (is(first.op, bytecode::kWithExceptStart)) {
     do_dprintf(kDbgExceptions, "  with exit at %d\n", target);
-    return Verdict::kNotCaught;
+    return with_exit_verdict(frame, entry, q, nesting, out);
   }
   if (is(first.op, bytecode::kBuildList) || is(first.op, bytecode::kCopy)) {
     int star = except_star_start(fc, ins.next);
     if (star >= 0) return except_star_chain(fc, ns, star, q);
   }
-  return except_chain(fc, ns, ins.next, q);
+  return except_chain(fc, ns, ins.next, q, &out->offset);
 }
 
-// Whether an except clause (or an async-for end) of `frame` catches the exception.
-bool frame_catches(PyFrameObject* frame, const Query& q) {
+// What the handlers active in `frame` do with the exception: the first that catches it, or
+// else the first `with` that may suppress it.
+FrameVerdict frame_verdict(PyFrameObject* frame, const Query& q, int nesting) {
+  FrameVerdict result;
   FrameCode fc;
-  if (!fc.open(frame)) return false;
+  if (!fc.open(frame)) return result;
   int offset = PyFrame_GetLasti(frame);
   Namespaces ns(frame);
   TableEntry entry;
   for (int hop = 0; hop < kMaxHandlerHops; ++hop) {
-    if (!bytecode::find_handler(fc.exception_table(), offset, &entry)) return false;
+    if (!bytecode::find_handler(fc.exception_table(), offset, &entry)) break;
     do_dprintf(kDbgExceptions, "  offset %d handled at %d\n", offset, entry.target);
-    if (handler_at(fc, ns, entry.target, q) == Verdict::kCaught) return true;
+    FrameVerdict here;
+    Verdict verdict = handler_at(frame, fc, ns, entry, q, nesting, &here);
+    if (verdict != Verdict::kNotCaught) {
+      if (!here.frame) here.frame = Ref::borrow(reinterpret_cast<PyObject*>(frame));
+      here.verdict = verdict;
+      if (verdict == Verdict::kCaught) return here;
+      if (result.verdict == Verdict::kNotCaught) result = std::move(here);
+    }
     // The entry covering the handler itself leads to the next handler outward.
     offset = entry.target;
   }
-  return false;
-}
-
-bool exc_matches(PyObject* exc, PyObject* cls) {
-  return PyErr_GivenExceptionMatches(exc, cls) != 0;
+  return result;
 }
 
 // Exceptions that end where a generator or coroutine body is left, whatever the callers do:
@@ -543,12 +661,101 @@ bool ends_at_body_exit(PyFrameObject* frame, PyObject* exc) {
   return async_gen && exc_matches(exc, PyExc_StopAsyncIteration);
 }
 
-bool stop_iter_handled(PyFrameObject* frame, PyObject* exc) {
-  if (!exc_matches(exc, PyExc_StopIteration) && !exc_matches(exc, PyExc_IndexError)) return false;
+bool is_generator_code(PyFrameObject* frame) {
+  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(frame)));
+  int flags = code ? reinterpret_cast<PyCodeObject*>(code.get())->co_flags : 0;
+  return (flags & (CO_GENERATOR | CO_COROUTINE | CO_ITERABLE_COROUTINE | CO_ASYNC_GENERATOR)) != 0;
+}
+
+// The opcode the frame stands on (its current instruction, or the call it waits in).
+int current_opcode(PyFrameObject* frame) {
   FrameCode fc;
-  if (!fc.open(frame)) return false;
-  int op = fc.opcode_around(PyFrame_GetLasti(frame));
+  return fc.open(frame) ? fc.opcode_around(PyFrame_GetLasti(frame)) : -1;
+}
+
+// A `for` loop or a `yield from`/`await` ends with the StopIteration its iterator raises, at
+// the instruction that asks for the next item. An IndexError never ends them there: the C
+// iterator of the old sequence protocol ends its own IndexError before the loop sees it.
+bool stop_iter_handled(PyFrameObject* frame, PyObject* exc) {
+  if (!exc_matches(exc, PyExc_StopIteration)) return false;
+  int op = current_opcode(frame);
   return is(op, bytecode::kForIter) || is(op, bytecode::kSend);
+}
+
+// A generator or coroutine resumed by its caller's `for` or `yield from`/`await`: the C code
+// between them (the generator's next/send) passes every exception on, so this entry from C
+// is no place where the exception may end.
+bool resumed_by_caller_loop(PyFrameObject* frame, PyFrameObject* caller) {
+  if (!is_generator_code(frame)) return false;
+  int op = current_opcode(caller);
+  return is(op, bytecode::kForIter) || is(op, bytecode::kSend);
+}
+
+// Code that runs in a namespace (a module, a class body, text given to exec or eval) is
+// started by exec, eval, the class statement or the import system's exec, which end no
+// exception: entering it from C is no place where the exception may end.
+bool runs_in_namespace(PyFrameObject* frame) {
+  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(frame)));
+  int flags = code ? reinterpret_cast<PyCodeObject*>(code.get())->co_flags : CO_OPTIMIZED;
+  return (flags & CO_OPTIMIZED) == 0;
+}
+
+// True when C code lies between `frame` and `caller` that may end the exception.
+bool c_code_between(PyFrameObject* frame, PyFrameObject* caller) {
+  return compat::frame_entered_from_c(frame) && !runs_in_namespace(frame) &&
+         !resumed_by_caller_loop(frame, caller);
+}
+
+CatchPrediction prediction(CatchKind kind, Ref frame, int offset) {
+  CatchPrediction p;
+  p.kind = kind;
+  p.frame = std::move(frame);
+  p.offset = offset;
+  return p;
+}
+
+CatchPrediction from_verdict(FrameVerdict& v) {
+  return prediction(v.verdict == Verdict::kCaught ? CatchKind::kCaught : CatchKind::kWith,
+                    std::move(v.frame), v.offset);
+}
+
+// The walk from the frame where the exception is now outward. The first place that surely
+// catches it answers; else the innermost place that may (a `with` exit, C code).
+//
+// The debugger marks its own frames (those that run the program) as frames whose handlers
+// are ignored; from the first of them outward only a sure catch counts: the debugger's own
+// `with` blocks and calls into C never end the program's exceptions.
+CatchPrediction walk_frames(const CatchQuestion& question, const Query& q) {
+  CatchPrediction maybe;
+  bool maybe_counts = true;
+  Ref current = Ref::borrow(question.frame);
+  for (bool first = true; current; first = false) {
+    if (!compat::is_plain_frame(current.get())) {
+      if (question.this_frame_only) break;
+      current = frame_back(current.get());
+      continue;
+    }
+    PyFrameObject* f = as_frame(current.get());
+    bool leaving = first && question.leaving_frame;
+    bool ignored = frame_handlers_ignored(current.get(), question.ignored_handlers) != 0;
+    if (ignored) maybe_counts = false;
+    if (!leaving && !ignored) {
+      if (first && stop_iter_handled(f, q.exc)) return prediction(CatchKind::kCaught, current, -1);
+      FrameVerdict verdict = frame_verdict(f, q, 0);
+      if (verdict.verdict == Verdict::kCaught) return from_verdict(verdict);
+      if (verdict.verdict != Verdict::kNotCaught && maybe_counts &&
+          maybe.kind == CatchKind::kUncaught)
+        maybe = from_verdict(verdict);
+    }
+    if (ends_at_body_exit(f, q.exc)) return prediction(CatchKind::kCaught, current, -1);
+    if (question.this_frame_only || current.get() == question.outermost) break;
+    Ref back = compat::frame_back(f);
+    if (back && compat::is_plain_frame(back.get()) && maybe_counts &&
+        maybe.kind == CatchKind::kUncaught && c_code_between(f, as_frame(back.get())))
+      maybe = prediction(CatchKind::kCCode, back, -1);
+    current = std::move(back);
+  }
+  return maybe;
 }
 
 // A handler the compiler wraps around code by itself, with no construct of the user's behind
@@ -567,10 +774,6 @@ bool compiler_wrapper_at(const FrameCode& fc, int target) {
            fc.decode(next.next, &next) && is(next.op, bytecode::kSwap);
   }
   return false;
-}
-
-PyFrameObject* as_frame(PyObject* obj) {
-  return reinterpret_cast<PyFrameObject*>(obj);
 }
 
 }  // namespace
@@ -592,26 +795,37 @@ int frame_handlers_ignored(PyObject* frame, PyObject* ignored_handlers) {
   return found == 1 ? 1 : 0;
 }
 
+CatchPrediction predict_catch(const CatchQuestion& question) {
+  if (!table().ready || question.frame == nullptr || question.exc == nullptr)
+    return CatchPrediction();
+  KeepThreadState keep;
+  PyObject* exc = question.exc;
+  Query q{exc, PyExceptionInstance_Check(exc) ? reinterpret_cast<PyObject*>(Py_TYPE(exc)) : exc,
+          question.match_kind};
+  CatchPrediction answer = walk_frames(question, q);
+  do_dprintf(kDbgExceptions, "predict_catch: %d\n", static_cast<int>(answer.kind));
+  return answer;
+}
+
+int catch_prediction_line(const CatchPrediction& prediction) {
+  if (!prediction.frame || !compat::is_plain_frame(prediction.frame.get())) return 0;
+  PyFrameObject* frame = as_frame(prediction.frame.get());
+  if (prediction.offset < 0) return PyFrame_GetLineNumber(frame);
+  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(frame)));
+  int line =
+      code ? PyCode_Addr2Line(reinterpret_cast<PyCodeObject*>(code.get()), prediction.offset) : -1;
+  return line > 0 ? line : PyFrame_GetLineNumber(frame);
+}
+
 int __tracer_exc_handled(PyObject* frame, PyObject* ignored_handlers, PyObject* exc,
                          int match_kind, int this_frame_only) {
-  if (!table().ready || frame == nullptr || exc == nullptr) return 0;
-  KeepThreadState keep;
-  Query q{exc,
-          PyExceptionInstance_Check(exc) ? reinterpret_cast<PyObject*>(Py_TYPE(exc)) : exc,
-          match_kind};
-  int handled = 0;
-  Ref current = Ref::borrow(frame);
-  while (current && !handled) {
-    if (compat::is_plain_frame(current.get())) {
-      PyFrameObject* f = as_frame(current.get());
-      if (!frame_handlers_ignored(current.get(), ignored_handlers)) {
-        handled = stop_iter_handled(f, exc) || frame_catches(f, q);
-      }
-      if (!handled) handled = ends_at_body_exit(f, exc);
-    }
-    if (this_frame_only) break;
-    current = frame_back(current.get());
-  }
+  CatchQuestion question;
+  question.frame = frame;
+  question.exc = exc;
+  question.ignored_handlers = ignored_handlers;
+  question.match_kind = match_kind;
+  question.this_frame_only = this_frame_only != 0;
+  int handled = predict_catch(question).kind == CatchKind::kCaught ? 1 : 0;
   do_dprintf(kDbgExceptions, "__tracer_exc_handled: %d\n", handled);
   return handled;
 }

@@ -21,6 +21,8 @@
 
 #include <Python.h>
 
+#include "support/ref.h"
+
 // How a clause's class is compared with the exception.
 enum HandlerMatchKind : int {
   // The interpreter's own test (subclasses match, tuples by any item); a bare `except:` catches.
@@ -41,19 +43,55 @@ int init_handler_analysis();
 // frame itself as a key; else 0. A failing lookup is cleared and counts as not ignored.
 int frame_handlers_ignored(PyObject* frame, PyObject* ignored_handlers);
 
-// 1 when an active handler of `frame`, or (unless this_frame_only) of a frame further out,
-// catches `exc` under `match_kind`; else 0. `exc` is the exception instance (preferred: the
-// identity match of kind 2 and `except*` over a group need it) or its class. Frames whose
-// handlers are ignored (frame_handlers_ignored) are passed over, their callers still searched.
-// Besides except clauses, an exception counts as handled where the interpreter itself ends it:
-// StopIteration or IndexError reaching a running `for` loop or `yield from`/`await`, a
-// StopIteration (or StopAsyncIteration) that a generator or coroutine turns into RuntimeError
-// when it leaves the body, and GeneratorExit leaving a generator that close() is finishing.
+// What will become of an exception, seen from the frame where it is now.
+enum class CatchKind : int {
+  kUncaught = 0,  // nothing catches it
+  kCaught,        // an except clause (or the interpreter, ending a loop) of `frame` catches it
+  kCCode,         // C code called from `frame` may end it: we cannot read what C code does
+  kWith,          // the exit of a `with` block running in `frame` may suppress it
+};
+
+struct CatchPrediction {
+  CatchKind kind = CatchKind::kUncaught;
+  Ref frame;        // the frame that catches, that called into C, or that runs the `with`
+  int offset = -1;  // byte offset in that frame's code of the handler or `with` exit; -1:
+                    // the frame's current instruction (the call, the loop)
+};
+
+struct CatchQuestion {
+  PyObject* frame = nullptr;             // borrowed: where the exception is now
+  PyObject* exc = nullptr;               // borrowed: the instance (preferred) or its class
+  PyObject* ignored_handlers = nullptr;  // borrowed or null: frames whose handlers are passed over
+  int match_kind = kMatchGiven;
+  bool this_frame_only = false;
+  PyObject* outermost = nullptr;  // borrowed or null: the walk ends after this frame
+  // The exception is leaving `frame`: its handlers already had their turn (and its value
+  // stack is gone; the instruction it reports may be the original raise again).
+  bool leaving_frame = false;
+};
+
+// Walks from the frame outward and answers with the first place that surely catches the
+// exception; when none does, with the innermost place that may (a `with` exit that is not
+// readable, or C code between two Python frames: a frame entered from C that is not a
+// generator resumed by its caller's loop); else uncaught. Within a frame, handlers are read
+// as described at the top. Exact `with` exits: contextlib.suppress by its types, and a
+// @contextmanager generator by the handlers around its suspended yield. Besides handlers,
+// the interpreter itself ends a StopIteration at the FOR_ITER or SEND the first frame stands
+// on, and StopIteration, StopAsyncIteration and GeneratorExit where a generator body is left.
+// Never runs code of the program except the class expressions of except clauses; keeps the
+// pending exception and leaves no error.
+CatchPrediction predict_catch(const CatchQuestion& question);
+
+// The line a prediction names: of its handler or `with`, or the frame's current line; 0
+// without a frame.
+int catch_prediction_line(const CatchPrediction& prediction);
+
+// 1 when predict_catch answers kCaught for these arguments (the walk goes to the last frame).
 int __tracer_exc_handled(PyObject* frame, PyObject* ignored_handlers, PyObject* exc,
                          int match_kind, int this_frame_only);
 
 // 1 when the frame's current instruction is FOR_ITER or SEND and `exc` (instance or class)
-// matches StopIteration or IndexError: the running loop or delegation ends with it.
+// matches StopIteration: the running loop or delegation ends with it.
 int exc_stop_iter_handled(PyObject* frame, PyObject* exc);
 
 // 1 when some exception-table entry other than the compiler's own catch-all wrappers (the

@@ -4,6 +4,10 @@
 
 #include <Python.h>
 
+// analysis_module.cpp: makes the submodule `analysis` and sets it on the main module and in
+// sys.modules. 0, or -1 with the error set.
+int add_analysis_module(PyObject* parent);
+
 // vantrelmodule.cpp: lifecycle.
 PyObject* _tracer_init(PyObject* self, PyObject* args);
 PyObject* _tracer_reset(PyObject* self, PyObject* args);

@@ -319,6 +319,10 @@ PyMODINIT_FUNC PyInit_tvantrel30pydebugstackless(void) {
   // The handler analysis reads the interpreter's opcode tables now, never inside an event;
   // when they cannot be read it answers "not caught" everywhere.
   init_handler_analysis();
+  if (add_analysis_module(gModuleSelf) != 0) {
+    Py_CLEAR(gModuleSelf);
+    return nullptr;
+  }
   // A ticker that keeps the idle callback going under sys.monitoring must end before the
   // interpreter finalises.
   init_idle_ticker();

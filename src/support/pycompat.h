@@ -350,6 +350,137 @@ inline PyObject* return_value_of_event(PyFrameObject* last_exception_frame, PyFr
 #endif
 }
 
+// ---- The interpreter's own frame records (private layout) --------------------------------
+//
+// Two questions about a running frame have no public answer: was it entered from C code
+// (the interpreter started a new evaluation loop for it, so C code lies between it and its
+// caller), and which object sits at a given depth of its value stack (a `with` block keeps
+// its exit there). Both read the interpreter's frame record, whose head differs per version;
+// tests/native/core/test_private_fields.cpp fails where these fields move.
+
+namespace detail {
+
+// The head of a frame object: the pointer to its interpreter frame follows f_back.
+struct FrameObjectHead {
+  PyObject ob_base;
+  PyObject* f_back;
+  void* f_frame;
+};
+
+#if PY_VERSION_HEX < 0x030C0000
+struct InterpFrame {
+  PyObject* f_func;
+  PyObject* f_globals;
+  PyObject* f_builtins;
+  PyObject* f_locals;
+  PyObject* f_code;
+  PyObject* frame_obj;
+  InterpFrame* previous;
+  void* prev_instr;
+  int stacktop;
+  bool is_entry;  // set on the frame an evaluation loop started with
+  char owner;
+  uintptr_t localsplus[1];
+};
+#elif PY_VERSION_HEX < 0x030E0000
+struct InterpFrame {
+  PyObject* f_code;
+  InterpFrame* previous;
+  PyObject* f_funcobj;
+  PyObject* f_globals;
+  PyObject* f_builtins;
+  PyObject* f_locals;
+  PyObject* frame_obj;
+  void* instr;
+  int stacktop;
+  uint16_t return_offset;
+  char owner;
+  uintptr_t localsplus[1];
+};
+#else
+struct InterpFrame {
+  uintptr_t f_executable;
+  InterpFrame* previous;
+  uintptr_t f_funcobj;
+  PyObject* f_globals;
+  PyObject* f_builtins;
+  PyObject* f_locals;
+  PyObject* frame_obj;
+  void* instr_ptr;
+  void* stackpointer;
+  uint16_t return_offset;
+  char owner;
+  uint8_t visited;
+  uintptr_t localsplus[1];
+};
+#endif
+
+// From 3.12 on, an evaluation loop started from C pushes a record of its own below the first
+// frame it runs, owned by the C stack (3.12, 3.13: owner 3) or by the interpreter (3.14+:
+// owner 3 or above); real frames have owners 0 to 2.
+constexpr char kFirstEntryOwner = 3;
+// A finished frame whose record its frame object took over: its value stack is cleared.
+constexpr char kOwnedByFrameObject = 2;
+
+// Stack slots of 3.14+ carry tag bits in their low bits (reference-count deferral, and from
+// 3.15 small ints); an object pointer is the slot without them.
+#if PY_VERSION_HEX >= 0x030F0000
+constexpr uintptr_t kStackTagBits = 3;
+#elif PY_VERSION_HEX >= 0x030E0000
+constexpr uintptr_t kStackTagBits = 1;
+#else
+constexpr uintptr_t kStackTagBits = 0;
+#endif
+
+inline InterpFrame* interp_frame(PyFrameObject* frame) noexcept {
+  return static_cast<InterpFrame*>(reinterpret_cast<FrameObjectHead*>(frame)->f_frame);
+}
+
+}  // namespace detail
+
+// True when the running frame was entered from C code: a builtin, a slot such as
+// __getattr__ or __getitem__ called by the interpreter's C code, exec(), an iterator's next.
+inline bool frame_entered_from_c(PyFrameObject* frame) noexcept {
+  detail::InterpFrame* f = detail::interp_frame(frame);
+  if (f == nullptr) return false;
+#if PY_VERSION_HEX < 0x030C0000
+  return f->is_entry;
+#else
+  return f->previous != nullptr && f->previous->owner >= detail::kFirstEntryOwner;
+#endif
+}
+
+// The object at `depth` (0 = the bottom) of the frame's value stack. Borrowed. The caller
+// must know from the code that the stack holds at least depth + 1 items there (an exception
+// table entry covering the frame's instruction guarantees its own depth). Null when the slot
+// does not hold an object.
+inline PyObject* frame_stack_item(PyFrameObject* frame, int depth) noexcept {
+  detail::InterpFrame* f = detail::interp_frame(frame);
+  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(frame)));
+  if (f == nullptr || !code || depth < 0 || f->owner == detail::kOwnedByFrameObject) return nullptr;
+  int base = reinterpret_cast<PyCodeObject*>(code.get())->co_nlocalsplus;
+  uintptr_t slot = f->localsplus[base + depth];
+  if ((slot & detail::kStackTagBits) != 0 && detail::kStackTagBits > 1 && (slot & 3) != 1)
+    return nullptr;  // a tagged small int or an invalid slot
+  return reinterpret_cast<PyObject*>(slot & ~detail::kStackTagBits);
+}
+
+// The context manager of the `with` block whose body an exception-table entry of stack depth
+// `depth` protects: the block keeps its exit on the value stack just below that depth (a
+// bound method up to 3.13; the function and the manager as two items from 3.14 on).
+// Borrowed; null when the exit is not a bound method of a Python class.
+inline PyObject* with_manager_of(PyFrameObject* frame, int depth) noexcept {
+  if (depth < 1) return nullptr;
+#if PY_VERSION_HEX >= 0x030E0000
+  if (depth < 2 || frame_stack_item(frame, depth - 2) == nullptr) return nullptr;
+  return frame_stack_item(frame, depth - 1);
+#else
+  PyObject* exit = frame_stack_item(frame, depth - 1);
+  if (exit == nullptr || !PyMethod_Check(exit)) return nullptr;
+  return PyMethod_GET_SELF(exit);
+#endif
+}
+
 // ---- f_trace -------------------------------------------------------------------------------
 //
 // Frames are opaque from 3.11 on, so f_trace is an attribute. Going through the frame type's

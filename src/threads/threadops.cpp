@@ -133,6 +133,12 @@ void renew_thread_data(ThreadData* data) {
   data->line_range_end = -1;
   data->leaving_bot_frame = 0;
   data->last_exception_frame = nullptr;
+  data->unhandled_stop_exc = nullptr;
+  data->unhandled_stop_frame = nullptr;
+  data->unhandled_stop_code = nullptr;
+  data->exception_leaving_frame = nullptr;
+  data->with_may_suppress_in = nullptr;
+  data->unhandled_stop_frame = nullptr;
   ++gThreadTableGeneration;
   for (Ref& ref : held) ref.reset();
 }

@@ -52,6 +52,19 @@ struct ThreadData {
   // Borrowed, only compared: the frame of the thread's latest event if that was an
   // exception event (tells a frame left by an exception where the interpreter does not).
   PyFrameObject* last_exception_frame = nullptr;
+  // Borrowed, only compared (holding them would change the program's reference counts): the
+  // exception the thread last stopped on because nothing would catch it, the frame of that
+  // stop and its code. The outer frames it then passes through report it again; it is
+  // stopped on once.
+  const void* unhandled_stop_exc = nullptr;
+  const void* unhandled_stop_frame = nullptr;
+  const void* unhandled_stop_code = nullptr;
+  // Borrowed, only compared: the frame an exception is leaving while a stop is made there
+  // (its handlers had their turn; its value stack is gone).
+  const void* exception_leaving_frame = nullptr;
+  // Borrowed, only compared: the frame whose latest exception event found that only a `with`
+  // exit might end the exception; it decides again when the exception leaves it.
+  const void* with_may_suppress_in = nullptr;
   // How many holders pin this record (see above); only the pinning code changes it.
   int32_t pins = 0;
 };

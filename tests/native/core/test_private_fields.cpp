@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "core_test_support.h"
+#include "exc/opcodes.h"
 
 namespace {
 
@@ -243,3 +244,95 @@ TEST_F(PrivateFieldTest, MethodDefinitionIsTheBuiltinFunctionsOwn) {
 }
 
 }  // namespace
+
+// ---- The interpreter's frame records -----------------------------------------------------
+
+namespace frames {
+
+const char* const kSource = R"(
+import contextlib
+
+def direct():
+    probe()
+
+def python_caller():
+    direct()
+
+def key(item):
+    probe()
+    return item
+
+def through_c():
+    sorted([2, 1], key=key)
+
+def in_suppress():
+    with contextlib.suppress(KeyError):
+        probe()
+
+class Manager:
+    def __enter__(self):
+        return self
+    def __exit__(self, *info):
+        return False
+
+manager = Manager()
+
+def nested_in_loop():
+    for _ in range(1):
+        with manager:
+            probe()
+)";
+
+// The depth of the exception-table entry that covers the frame's current instruction.
+int handler_depth(PyFrameObject* frame) {
+  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(frame)));
+  bytecode::TableEntry entry;
+  if (!code ||
+      !bytecode::find_handler(reinterpret_cast<PyCodeObject*>(code.get())->co_exceptiontable,
+                              PyFrame_GetLasti(frame), &entry))
+    return -1;
+  return entry.depth;
+}
+
+}  // namespace frames
+
+TEST_F(PrivateFieldTest, EntryFrameMarkTellsFramesCalledFromC) {
+  ASSERT_EQ(bytecode::init_opcodes(), 0);
+  Ref globals = coretest::make_namespace(frames::kSource);
+  ASSERT_TRUE(globals);
+  bool entered = false;
+  // run_in_frame calls the function itself from C.
+  ASSERT_TRUE(coretest::run_in_frame(globals.get(), "direct", [&](PyFrameObject* frame) {
+    entered = compat::frame_entered_from_c(frame);
+  }));
+  EXPECT_TRUE(entered);
+  ASSERT_TRUE(coretest::run_in_frame(globals.get(), "python_caller", [&](PyFrameObject* frame) {
+    entered = compat::frame_entered_from_c(frame);
+  }));
+  EXPECT_FALSE(entered) << "a Python call counted as a call from C";
+  ASSERT_TRUE(coretest::run_in_frame(globals.get(), "through_c", [&](PyFrameObject* frame) {
+    entered = compat::frame_entered_from_c(frame);
+  }));
+  EXPECT_TRUE(entered) << "sorted() calling the key did not count as a call from C";
+}
+
+TEST_F(PrivateFieldTest, ValueStackHoldsTheExitOfTheRunningWithBlock) {
+  ASSERT_EQ(bytecode::init_opcodes(), 0);
+  Ref globals = coretest::make_namespace(frames::kSource);
+  ASSERT_TRUE(globals);
+  Ref contextlib = Ref::steal(PyImport_ImportModule("contextlib"));
+  Ref suppress = Ref::steal(PyObject_GetAttrString(contextlib.get(), "suppress"));
+  ASSERT_TRUE(suppress);
+  PyObject* manager = nullptr;
+  ASSERT_TRUE(coretest::run_in_frame(globals.get(), "in_suppress", [&](PyFrameObject* frame) {
+    manager = compat::with_manager_of(frame, frames::handler_depth(frame));
+    ASSERT_NE(manager, nullptr);
+    EXPECT_EQ(reinterpret_cast<PyObject*>(Py_TYPE(manager)), suppress.get());
+  }));
+  // Below the with block the loop keeps its iterator: the exit is found above it.
+  ASSERT_TRUE(coretest::run_in_frame(globals.get(), "nested_in_loop", [&](PyFrameObject* frame) {
+    EXPECT_GE(frames::handler_depth(frame), 2);
+    EXPECT_EQ(compat::with_manager_of(frame, frames::handler_depth(frame)),
+              coretest::item(globals.get(), "manager"));
+  }));
+}
