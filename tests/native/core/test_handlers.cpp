@@ -347,9 +347,14 @@ def main():
   for (const char* tag : {"for", "seq", "yield-from"}) {
     const auto& raise = r.find(tag);
     EXPECT_EQ(raise.this_frame[kMatchGiven], 0) << tag;  // __next__ itself does not catch
-    EXPECT_EQ(raise.handled[kMatchGiven], 1) << tag;
     EXPECT_EQ(raise.stop_iter, 0) << tag;
   }
+  // The loop's C iterator calls __next__ and __getitem__ and ends their exceptions: from
+  // their frames that is C code that may end it, not a sure catch. Below `yield from` the
+  // delegating generator's body is the sure end of a StopIteration.
+  EXPECT_EQ(r.find("for").handled[kMatchGiven], 0);
+  EXPECT_EQ(r.find("seq").handled[kMatchGiven], 0);
+  EXPECT_EQ(r.find("yield-from").handled[kMatchGiven], 1);
   // A generator's return value arrives in the loop's own frame, standing on FOR_ITER.
   const auto& ret = r.find("gen-return");
   EXPECT_EQ(ret.where, "main");
