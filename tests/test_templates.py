@@ -273,7 +273,7 @@ def test_an_exception_of_a_template_line_is_reported_at_that_line(tmp_path, mode
                 first="continue_run", exception_mode=mode, when_elsewhere="continue_run",
                 probe="frame.f_code.co_name")
     assert "ZeroDivisionError" in run.stderr
-    assert_stops(run.stops, [
+    expected = [
         ("exception", "err.tpl", 2, "_execute", "ZeroDivisionError", "_execute"),
         # The core reports the template line's exception again in each frame of the engine
         # it passes through (the hook is asked about the innermost frame, the template
@@ -282,7 +282,12 @@ def test_an_exception_of_a_template_line_is_reported_at_that_line(tmp_path, mode
         ("exception", "engine.py", "impl", "render", "ZeroDivisionError", "render"),
         ("exception", "prog.py", 4, "page", "ZeroDivisionError", "page"),
         ("exception", "prog.py", 7, "<module>", "ZeroDivisionError", "<module>"),
-    ])
+    ]
+    if mode == 2:
+        # The stop at the template line is the sub-language's own; the first frame that
+        # finds the exception unhandled stops once, and the outer frames no more.
+        expected = expected[:2]
+    assert_stops(run.stops, expected)
 
 
 CAUGHT_PROGRAM = """
