@@ -700,10 +700,17 @@ bool runs_in_namespace(PyFrameObject* frame) {
   return (flags & CO_OPTIMIZED) == 0;
 }
 
+// A call with unpacked arguments where the interpreter reaches even a Python function
+// through its C call machinery. (A builtin called that way that calls back into Python, say
+// getattr(*args), is then not seen: a stop it could have spared may happen; none is lost.)
+bool star_call_through_c(PyFrameObject* caller) {
+  return compat::kStarCallGoesThroughC && is(current_opcode(caller), bytecode::kCallFunctionEx);
+}
+
 // True when C code lies between `frame` and `caller` that may end the exception.
 bool c_code_between(PyFrameObject* frame, PyFrameObject* caller) {
   return compat::frame_entered_from_c(frame) && !runs_in_namespace(frame) &&
-         !resumed_by_caller_loop(frame, caller);
+         !resumed_by_caller_loop(frame, caller) && !star_call_through_c(caller);
 }
 
 CatchPrediction prediction(CatchKind kind, Ref frame, int offset) {

@@ -49,6 +49,7 @@ constexpr const char* kOpNames[kOpCount] = {
     "CLEANUP_THROW",
     "FOR_ITER",
     "SEND",
+    "CALL_FUNCTION_EX",
 };
 
 // Without these the shapes of an except clause cannot be read at all.

@@ -54,6 +54,7 @@ enum Op : int {
   kCleanupThrow,
   kForIter,
   kSend,
+  kCallFunctionEx,
   kOpCount
 };
 

@@ -450,6 +450,11 @@ inline bool frame_entered_from_c(PyFrameObject* frame) noexcept {
 #endif
 }
 
+// Whether `f(*args, **kwargs)` of a Python function reaches it through the interpreter's C
+// call machinery (3.11), which passes every exception on; from 3.12 on such a call enters
+// the function directly, and a frame entered from C under it was called by a builtin.
+constexpr bool kStarCallGoesThroughC = PY_VERSION_HEX < 0x030C0000;
+
 // The object at `depth` (0 = the bottom) of the frame's value stack. Borrowed. The caller
 // must know from the code that the stack holds at least depth + 1 items there (an exception
 // table entry covering the frame's instruction guarantees its own depth). Null when the slot
