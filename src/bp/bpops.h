@@ -11,7 +11,9 @@
 #include <Python.h>
 
 #include <cstdint>
+#include <memory>
 
+#include "bp/condition.h"
 #include "names/fileops.h"
 #include "support/hashtable.h"
 #include "support/ref.h"
@@ -32,6 +34,9 @@ struct Breakpoint {
   int32_t on_changed_list;   // 1 while on the changed list
   Breakpoint* next_at_line;  // chain of the same line number
   Breakpoint* next_changed;  // changed list
+  // The condition compiled, made at its first evaluation and dropped when the text changes;
+  // shared so that an evaluation keeps it while the condition's code frees the record.
+  std::shared_ptr<const CompiledCondition> compiled;
 };
 
 struct BpOpsData {

@@ -81,44 +81,31 @@ bool files_match(BpOpsData* data, const LineEvent& at, const Breakpoint* bp) {
   return modfile != nullptr && strcmp(modfile, bp->module_filename) == 0;
 }
 
-// The locals a condition is evaluated with: the current values of the frame's variables,
-// never written back. On 3.11 and 3.12 PyFrame_GetLocals copies the fast locals into the
-// frame's locals dictionary; from 3.13 on it answers a write-through proxy of them, so a
-// condition such as `(x := 5) == 0` would change the program's variable. A function frame's
-// condition therefore gets a dictionary copy on every version. Module-level code and class
-// bodies have no fast locals: their namespace is used as it is.
-Ref condition_locals(PyFrameObject* f) {
-  Ref locals = Ref::steal(PyFrame_GetLocals(f));
-  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(f)));
-  bool fast = (reinterpret_cast<PyCodeObject*>(code.get())->co_flags & CO_OPTIMIZED) != 0;
-  if (!locals || !fast) return locals;
-  Ref copy = Ref::steal(PyDict_New());
-  if (!copy || PyDict_Update(copy.get(), locals.get()) != 0) return Ref();
-  return copy;
+// The record's compiled condition, made at its first evaluation. The caller holds its own
+// reference: the condition's code may change the text or free the record.
+std::shared_ptr<const CompiledCondition> compiled_condition(Breakpoint* bp) {
+  if (!bp->compiled) bp->compiled = condition_compile(bp->cond);
+  return bp->compiled;
 }
 
 // Evaluates a condition in the frame's namespace: 1 true, 0 false, -1 when it cannot be
 // evaluated (a broken condition stops). Nothing it raises reaches the program.
-int evaluate_condition(const LineEvent& at, const char* cond) {
+int evaluate_condition(const LineEvent& at, Breakpoint* bp) {
   compat::PendingError saved;
   saved.fetch();
-  Ref result;
+  int truth = -1;
   if (at.sub_language) {
-    Ref text = Ref::steal(gPtrTo_PyUnicode_FromString(cond));
+    Ref text = Ref::steal(gPtrTo_PyUnicode_FromString(bp->cond));
+    Ref result;
     if (text) {
       result = Ref::steal(PyObject_CallMethod(at.thread->sub_language_hook.get(), "_Eval", "OO",
                                               text.get(), at.frame));
     }
+    truth = result ? PyObject_IsTrue(result.get()) : -1;
   } else {
-    auto* f = reinterpret_cast<PyFrameObject*>(at.frame);
-    Ref locals = condition_locals(f);
-    Ref globals = Ref::steal(PyFrame_GetGlobals(f));
-    if (locals && globals) {
-      result =
-          Ref::steal(PyRun_StringFlags(cond, Py_eval_input, globals.get(), locals.get(), nullptr));
-    }
+    std::shared_ptr<const CompiledCondition> condition = compiled_condition(bp);
+    truth = condition_evaluate(*condition, reinterpret_cast<PyFrameObject*>(at.frame));
   }
-  int truth = result ? PyObject_IsTrue(result.get()) : -1;
   saved.restore();  // also drops whatever the condition raised
   return truth < 0 ? -1 : truth;
 }
@@ -177,7 +164,7 @@ int __tracer_break_here(BpOpsData* data, int event, ThreadData* thread, PyObject
       continue;
     }
     uint64_t frees = data->free_count;
-    int truth = evaluate_condition(at, bp->cond);
+    int truth = evaluate_condition(at, bp);
     // The condition freed breakpoints (cleared them, or reset the core): neither this record
     // nor the rest of the chain may be touched any more.
     if (frees != data->free_count) return stop || truth != 0 ? 1 : 0;
