@@ -8,6 +8,8 @@
 
 #include <cstring>
 
+#include "bp/fastcond.h"
+
 namespace {
 
 // Names whose use means the condition may look at its namespace as a whole or reach frames:
@@ -116,12 +118,17 @@ std::shared_ptr<const CompiledCondition> condition_compile(const char* text) {
   // a copy.
   condition->can_store = std::strstr(text, ":=") != nullptr;
   condition->reads_all = uses_introspection(condition->code.get(), 0);
+  condition->fast = fast_condition_parse(text);
   PyErr_Clear();
   return condition;
 }
 
 int condition_evaluate(const CompiledCondition& condition, PyFrameObject* frame) {
   if (!condition.code) return -1;  // does not compile: stops every time
+  if (condition.fast) {
+    int answer = fast_condition_evaluate(*condition.fast, frame);
+    if (answer != kFastUndecided) return answer;
+  }
   Ref locals = condition_locals(condition, frame);
   Ref globals = Ref::steal(PyFrame_GetGlobals(frame));
   if (!locals || !globals) return -1;

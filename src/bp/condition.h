@@ -11,11 +11,14 @@
 
 #include "support/ref.h"
 
+struct FastCondition;
+
 struct CompiledCondition {
   Ref code;                // owned: the code object; null when the text does not compile
   Ref names;               // owned: tuple of the names the code reads (its co_names)
   bool can_store = false;  // the text may bind a name (an assignment expression)
   bool reads_all = false;  // it may look at the whole namespace (locals(), eval, frames)
+  std::shared_ptr<const FastCondition> fast;  // the form evaluated without the eval loop
 };
 
 // The compiled form of `text`; never null (a text that does not compile gives a record

@@ -4,6 +4,10 @@
 
 #include <Python.h>
 
+// breakpoints_module.cpp: the submodule `breakpoints`, added to `parent` and sys.modules.
+// 0, or -1 with an error set.
+int add_breakpoints_module(PyObject* parent);
+
 // vantrelmodule.cpp: lifecycle.
 PyObject* _tracer_init(PyObject* self, PyObject* args);
 PyObject* _tracer_reset(PyObject* self, PyObject* args);

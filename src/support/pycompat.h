@@ -213,6 +213,24 @@ inline bool is_plain_frame(PyObject* obj) noexcept {
   return Py_IS_TYPE(obj, &PyFrame_Type);
 }
 
+// Whether `obj` is the write-through view of a function frame's variables that
+// PyFrame_GetLocals answers from 3.13 on (earlier versions answer a dictionary).
+inline bool is_frame_locals_proxy(PyObject* obj) noexcept {
+#if PY_VERSION_HEX >= 0x030D0000
+  return PyFrameLocalsProxy_Check(obj);
+#else
+  (void)obj;
+  return false;
+#endif
+}
+
+// The attribute `name` of `type` or of a type in its method resolution order, or null when
+// none has it. Borrowed; sets no error and runs no Python code. The interpreter's own
+// look-up (exported but private on every supported version).
+inline PyObject* type_lookup(PyTypeObject* type, PyObject* name) noexcept {
+  return _PyType_Lookup(type, name);
+}
+
 // The caller of `frame`, or a null Ref at the bottom. New reference.
 inline Ref frame_back(PyFrameObject* frame) noexcept {
   return Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetBack(frame)));
