@@ -165,4 +165,31 @@ TEST_F(CompatTest, UseTracingSwitchBelongsToTheThreadStateNotTheOsThread) {
   EXPECT_EQ(second_use, 0);  // no trace function in the new thread state
 }
 
+TEST_F(CompatTest, TypeLookupFindsClassAttributesAlongTheMroAndNothingElse) {
+  // The fast evaluation of conditions reads an instance attribute directly only when the
+  // type has no attribute of that name; the look-up must see inherited ones and never an
+  // instance's own.
+  Ref ns = coretest::make_namespace(
+      "class Base:\n    inherited = 1\nclass Child(Base):\n    pass\nobj = Child()\n"
+      "obj.own = 2\n");
+  auto* child = reinterpret_cast<PyTypeObject*>(coretest::item(ns.get(), "Child"));
+  Ref inherited = Ref::steal(PyUnicode_FromString("inherited"));
+  Ref own = Ref::steal(PyUnicode_FromString("own"));
+  Ref real = Ref::steal(PyUnicode_FromString("real"));
+  EXPECT_NE(compat::type_lookup(child, inherited.get()), nullptr);
+  EXPECT_EQ(compat::type_lookup(child, own.get()), nullptr);
+  EXPECT_NE(compat::type_lookup(&PyLong_Type, real.get()), nullptr);
+  EXPECT_EQ(PyErr_Occurred(), nullptr);
+}
+
+TEST_F(CompatTest, FrameLocalsProxyIsRecognisedWhereTheInterpreterAnswersOne) {
+  Ref ns = coretest::make_namespace(
+      "import sys\ndef f():\n    x = 1\n    return sys._getframe()\nframe = f()\n");
+  auto* frame = reinterpret_cast<PyFrameObject*>(coretest::item(ns.get(), "frame"));
+  Ref locals = Ref::steal(PyFrame_GetLocals(frame));
+  ASSERT_TRUE(locals);
+  EXPECT_EQ(compat::is_frame_locals_proxy(locals.get()), !PyDict_Check(locals.get()));
+  EXPECT_EQ(compat::is_frame_locals_proxy(PyLong_Type.tp_dict), false);
+}
+
 }  // namespace
