@@ -12,6 +12,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <string>
 
 #include "bp/condition.h"
 #include "names/fileops.h"
@@ -53,6 +54,16 @@ struct BpOpsData {
   // Counts every record freed, for the life of the process: code that runs Python code in
   // the middle of a walk over records (conditions) tells from it whether they still exist.
   uint64_t free_count = 0;
+  // Counts every change of the loaded-module table (a name stored or replaced, the table
+  // emptied), for the life of the process: a canonical name found earlier is still the
+  // answer, and still allocated, while it has not moved.
+  uint64_t modules_generation = 0;
+  // The last code file a line with breakpoints was met in, and its canonical module file
+  // (borrowed from the loaded-module table) as of `resolved_generation`. A hot line asks the
+  // same question at every pass.
+  std::string resolved_code_file;
+  const char* resolved_module_file = nullptr;  // null when no module has that file
+  uint64_t resolved_generation = UINT64_MAX;
 };
 
 void __tracer_init_bp_ops_data(BpOpsData* data, COPathnameTable* co_pathname_table);

@@ -25,6 +25,8 @@ struct LineEvent {
   PyObject* frame;
   int event;
   const char* code_file = nullptr;
+  const char* module_file = nullptr;        // the code file's canonical module file, or null
+  uint64_t module_generation = UINT64_MAX;  // of the loaded-module table when it was found
   int lineno = 0;
   bool sub_language = false;
   Ref translated;  // keeps a sub-language frame's file text alive
@@ -56,18 +58,44 @@ bool translate_sub_language_frame(LineEvent& at) {
   return wanted > 0 && usable;
 }
 
+// The code file's canonical module file. The answer for the file met last is kept while
+// the loaded-module table does not change (conditions run Python code, which may import and
+// register modules, or replace the stored name that an earlier answer points to). While
+// file-name diagnostics are written it is looked up each time, so that they show every step.
+const char* module_file_of(BpOpsData* data, LineEvent& at) {
+  if (dprintf_wanted(kDbgBpFiles)) return __tracer_find_module(data, at.code_file);
+  if (at.module_generation == data->modules_generation) return at.module_file;
+  bool same_file = at.code_file != nullptr && data->resolved_code_file == at.code_file;
+  if (same_file && data->resolved_generation == data->modules_generation) {
+    at.module_file = data->resolved_module_file;
+  } else {
+    at.module_file = __tracer_find_module(data, at.code_file);
+    if (at.code_file != nullptr) data->resolved_code_file = at.code_file;
+    data->resolved_module_file = at.module_file;
+    data->resolved_generation = data->modules_generation;
+  }
+  at.module_generation = data->modules_generation;
+  return at.module_file;
+}
+
 // The frame's full file name, which also registers its module so that breakpoints waiting
-// for that file learn it. The program's pending exception is kept.
+// for that file learn it. A file whose module is known already (the one met last, the table
+// unchanged since) has nothing to register. The program's pending exception is kept.
 void find_code_file(BpOpsData* data, LineEvent& at) {
   compat::PendingError saved;
   saved.fetch();
   at.code_file = __tracer_get_full_path(data->co_pathname_table, at.frame);
-  do_dprintf(kDbgBpFiles, "CODE FILE %s\n", dprint_check_str(at.code_file));
-  __tracer_resolve_bp_filenames(data, at.code_file);
+  bool known = !dprintf_wanted(kDbgBpFiles) && at.code_file != nullptr &&
+               data->resolved_generation == data->modules_generation &&
+               data->resolved_module_file != nullptr && data->resolved_code_file == at.code_file;
+  if (!known) {
+    do_dprintf(kDbgBpFiles, "CODE FILE %s\n", dprint_check_str(at.code_file));
+    __tracer_resolve_bp_filenames(data, at.code_file);
+  }
   saved.restore();
 }
 
-bool files_match(BpOpsData* data, const LineEvent& at, const Breakpoint* bp) {
+bool files_match(BpOpsData* data, LineEvent& at, const Breakpoint* bp) {
   if (at.sub_language) {
     do_dprintf(kDbgBpFiles, "sub_language bp codefile = %s, bp->user_filename = %s\n",
                dprint_check_str(at.code_file), dprint_check_str(bp->user_filename));
@@ -75,7 +103,7 @@ bool files_match(BpOpsData* data, const LineEvent& at, const Breakpoint* bp) {
   }
   // A breakpoint whose file no loaded module has matched yet never matches a frame.
   if (bp->module_filename == nullptr) return false;
-  const char* modfile = __tracer_find_module(data, at.code_file);
+  const char* modfile = module_file_of(data, at);
   do_dprintf(kDbgBpFiles, "modfile = %s, bp->module_filename = %s\n", dprint_check_str(modfile),
              dprint_check_str(bp->module_filename));
   return modfile != nullptr && strcmp(modfile, bp->module_filename) == 0;
@@ -133,7 +161,7 @@ int __tracer_break_here(BpOpsData* data, int event, ThreadData* thread, PyObject
                         int count) {
   // No breakpoint anywhere: nothing to find, whatever the frame (the common line event).
   if (data->bp_table.num_entries == 0 || !compat::is_plain_frame(frame)) return 0;
-  LineEvent at{thread, frame, event, nullptr, 0, false, Ref()};
+  LineEvent at{thread, frame, event, nullptr, nullptr, UINT64_MAX, 0, false, Ref()};
   // Only a thread inside a sub-language has key frames (an inline test before the call).
   if (thread != nullptr && thread->sub_language_hook &&
       __tracer_sub_language_get_frame_category(thread, frame) == 1) {
