@@ -204,3 +204,23 @@ def test_the_submodule_is_importable_by_name():
     import importlib
     assert importlib.import_module("tvantrel30pydebugstackless.breakpoints") is breakpoints
     assert tvantrel30pydebugstackless.breakpoints is breakpoints
+
+
+def test_each_variable_is_read_from_its_own_slot():
+    def frame_of(first, second="two", *rest, **named):
+        third = 3.0
+        shared = "cell"
+
+        def inner():
+            return shared
+
+        return sys._getframe()
+
+    frame = frame_of(1, "two", 9, key=1)
+    for cond, want in [("first == 1", True), ("second == 'two'", True), ("third == 3.0", True),
+                       ("first == 'two'", False), ("second == 1", False),
+                       ("shared == 'cell'", True), ("rest is None", False)]:
+        fast, full = breakpoints.condition_answers(cond, frame)
+        assert full is want, cond
+        assert fast in (None, want), cond
+    assert breakpoints.condition_answers("third == 3.0", frame)[0] is True

@@ -398,14 +398,26 @@ bool dict_value(PyObject* mapping, PyObject* name, Ref& value) {
   return value || PyErr_Occurred() == nullptr;
 }
 
-// A name as the compiled code reads it: the locals, then the globals. From 3.13 on a
+Ref global_value(Scope& scope, PyObject* name) {
+  if (!scope.globals) scope.globals = Ref::steal(PyFrame_GetGlobals(scope.frame));
+  Ref value;
+  if (!scope.globals || !dict_value(scope.globals.get(), name, value)) return Ref();
+  return value;
+}
+
+// A name as the compiled code reads it: the locals, then the globals. A function frame's
+// plain variable is read from its slot where the interpreter lets us; from 3.13 on a
 // function frame's locals are a proxy whose item access reads the frame's variables (no
 // Python code). A name found in neither is left to the compiled code (a builtin, or an
 // error).
 Ref name_value(Scope& scope, PyObject* name) {
+  Ref value;
+  PyObject* slot = nullptr;
+  compat::FastLocal read = compat::frame_fast_local(scope.frame, name, &slot);
+  if (read == compat::FastLocal::kValue) return Ref::borrow(slot);
+  if (read == compat::FastLocal::kUnbound) return global_value(scope, name);
   if (!scope.locals) scope.locals = Ref::steal(PyFrame_GetLocals(scope.frame));
   if (!scope.locals) return Ref();
-  Ref value;
   if (compat::is_frame_locals_proxy(scope.locals.get())) {
     value = Ref::steal(PyObject_GetItem(scope.locals.get(), name));
     if (value) return value;
@@ -415,9 +427,7 @@ Ref name_value(Scope& scope, PyObject* name) {
     return Ref();
   }
   if (value) return value;
-  if (!scope.globals) scope.globals = Ref::steal(PyFrame_GetGlobals(scope.frame));
-  if (!scope.globals || !dict_value(scope.globals.get(), name, value)) return Ref();
-  return value;
+  return global_value(scope, name);
 }
 
 // `obj.name` where that reads the instance's (or module's) own dictionary: the type has no

@@ -192,4 +192,43 @@ TEST_F(CompatTest, FrameLocalsProxyIsRecognisedWhereTheInterpreterAnswersOne) {
   EXPECT_EQ(compat::is_frame_locals_proxy(PyLong_Type.tp_dict), false);
 }
 
+TEST_F(CompatTest, FrameFastLocalReadsThePlainVariablesOfARunningFunctionFrame) {
+  // The frame records' layout is the interpreter's own: a read that lands elsewhere answers
+  // wrong values here (or unknown everywhere), not only on the version where it moved.
+  Ref ns = coretest::make_namespace(
+      "import sys\n"
+      "def f(arg, other='o'):\n"
+      "    plain = 3\n"
+      "    cell = 4\n"
+      "    def inner():\n"
+      "        return cell\n"
+      "    frame = sys._getframe()\n"
+      "    result.append(frame)\n"
+      "    return frame\n"
+      "    unbound = 5\n"
+      "result = []\n"
+      "f(1)\n");
+  PyObject* frames = coretest::item(ns.get(), "result");
+  auto* frame = reinterpret_cast<PyFrameObject*>(PyList_GET_ITEM(frames, 0));
+  auto read = [&](const char* text, PyObject** value) {
+    Ref name = Ref::steal(PyUnicode_InternFromString(text));
+    return compat::frame_fast_local(frame, name.get(), value);
+  };
+  PyObject* value = nullptr;
+#if PY_VERSION_HEX < 0x030D0000
+  ASSERT_EQ(read("plain", &value), compat::FastLocal::kValue);
+  EXPECT_EQ(PyLong_AsLong(value), 3);
+  ASSERT_EQ(read("arg", &value), compat::FastLocal::kValue);
+  EXPECT_EQ(PyLong_AsLong(value), 1);
+  ASSERT_EQ(read("other", &value), compat::FastLocal::kValue);
+  EXPECT_EQ(PyUnicode_CompareWithASCIIString(value, "o"), 0);
+  EXPECT_EQ(read("unbound", &value), compat::FastLocal::kUnbound);
+  EXPECT_EQ(read("cell", &value), compat::FastLocal::kUnknown);
+  EXPECT_EQ(read("sys", &value), compat::FastLocal::kUnknown);
+#else
+  EXPECT_EQ(read("plain", &value), compat::FastLocal::kUnknown);
+#endif
+  EXPECT_EQ(PyErr_Occurred(), nullptr);
+}
+
 }  // namespace
