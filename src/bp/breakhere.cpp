@@ -168,7 +168,9 @@ int __tracer_break_here(BpOpsData* data, int event, ThreadData* thread, PyObject
     enter_debugger();  // the hook is Python code
     if (!translate_sub_language_frame(at)) return 0;
   } else {
-    at.lineno = PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(frame));
+    at.lineno = frame == data->line_hint_frame
+                    ? data->line_hint
+                    : PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(frame));
   }
   Breakpoint* bp = __tracer_bps_at_line(data, at.lineno);
   if (bp == nullptr) return 0;
