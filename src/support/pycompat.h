@@ -184,9 +184,7 @@ class PendingError {
 #endif
     exc_ = nullptr;
   }
-  bool empty() const noexcept {
-    return exc_ == nullptr && type_ == nullptr;
-  }
+  bool empty() const noexcept { return exc_ == nullptr && type_ == nullptr; }
 
   // Writes the held exception and its traceback to sys.stderr and keeps holding it. Unlike
   // PyErr_Print this never exits the process on SystemExit and leaves sys.last_* alone:
@@ -285,7 +283,7 @@ constexpr unsigned char kNotPlain = 0x10 | 0x40 | 0x80;  // hidden, cell, free
 }  // namespace frame_layout
 #endif
 
-// The plain local variable `name` (an interned str) of a running function frame, read from
+// The plain local variable `name` (a str) of a running function frame, read from
 // its slot: kValue with `*value` borrowed, or kUnbound. kUnknown when the frame is no
 // function's, `name` is not one of its plain locals (a cell, a free or hidden variable, a
 // name it does not have), or the interpreter offers no such read; the caller then asks
@@ -307,7 +305,12 @@ inline FastLocal frame_fast_local(PyFrameObject* frame, PyObject* name, PyObject
   PyObject* names = code->co_localsplusnames;
   const char* kinds = PyBytes_AS_STRING(code->co_localspluskinds);
   for (int i = 0; i < code->co_nlocalsplus; ++i) {
-    if (PyTuple_GET_ITEM(names, i) != name) continue;
+    PyObject* own = PyTuple_GET_ITEM(names, i);
+    // Names are interned on both sides as a rule; equal text is the same name regardless.
+    if (own != name && (PyUnicode_GET_LENGTH(own) != PyUnicode_GET_LENGTH(name) ||
+                        PyUnicode_Compare(own, name) != 0)) {
+      continue;
+    }
     auto kind = static_cast<unsigned char>(kinds[i]);
     if ((kind & frame_layout::kNotPlain) != 0 || (kind & frame_layout::kPlainLocal) == 0) {
       return FastLocal::kUnknown;
