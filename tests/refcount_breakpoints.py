@@ -73,7 +73,9 @@ def lines_of(tag):
 
 
 HOT = [lines_of(f"hot {k}")[0] for k in range(1, 5)]
-CONDITIONS = [None, "i % 2 == 0", "no_such_name", "", "1 +", "i > 100", "total >= 0"]
+CONDITIONS = [None, "i % 2 == 0", "no_such_name", "", "1 +", "i > 100", "total >= 0",
+              "i in (1, 2, 'x') and not total < 0", "len(str(i)) < 0", "(w := i) < 0",
+              "'i' in locals() and i == 1", "i.real == 1", "x" * 100_000]
 
 
 def set_breakpoints():

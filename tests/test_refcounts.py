@@ -281,3 +281,21 @@ def test_idle_ticker_sessions_leave_the_total_flat():
     totals = [int(x) for x in lines[:-2]]
     assert len(totals) == 5
     assert totals[1:] == [totals[0]] * 4, totals
+
+
+@needs_debug
+@pytest.mark.parametrize("cond", [
+    "x == 1", "s in 'abc' and not x", "x == 1 or s[0] == 'b'", "t.attr == 1", "len(s) == 1",
+    "(y := x) == 2", "no_such_name", "1 +", "'x' in locals()", "x < s", "t.missing == 1"])
+def test_evaluating_a_condition_holds_no_reference(cond):
+    from tvantrel30pydebugstackless import breakpoints
+
+    class Thing:
+        attr = None
+
+    def evaluate():
+        x, s, t = 1, "a", Thing()  # noqa: F841 (read by the condition)
+        t.attr = 1
+        return breakpoints.condition_answers(cond, sys._getframe())
+
+    assert growth(evaluate, repeat=200) == 0

@@ -20,7 +20,8 @@ const char* canonical_of(CU_HashEntry* entry) {
 
 // Stores a copy of `canonical` as the value of `entry`, freeing a value it had; the stored
 // copy, or null (entry deleted) when memory runs out.
-const char* store_canonical(CU_HashEntry* entry, const char* canonical) {
+const char* store_canonical(BpOpsData* data, CU_HashEntry* entry, const char* canonical) {
+  ++data->modules_generation;
   char* copy = strdup(canonical);
   if (copy == nullptr) {
     std::free(CU_GetHashValue(entry));
@@ -72,7 +73,7 @@ const char* add_to_loaded_modules_if_samefile(BpOpsData* data, const char* name,
   CU_HashEntry* entry = CU_CreateHashEntry(&data->loaded_modules, name, &is_new);
   if (entry == nullptr) return nullptr;
   if (is_new) CU_SetHashValue(entry, nullptr);
-  const char* stored = store_canonical(entry, module_file);
+  const char* stored = store_canonical(data, entry, module_file);
   if (stored != nullptr) do_dprintf(kDbgBpFiles, "Found synonym %s\n", dprint_check_str(name));
   return stored;
 }
@@ -96,6 +97,7 @@ const char* __tracer_find_module(BpOpsData* data, const char* name) {
 }
 
 void __tracer_clear_loaded_modules(BpOpsData* data) {
+  ++data->modules_generation;
   CU_DeallocHashTable(&data->loaded_modules);
   CU_InitHashTable(&data->loaded_modules, 0);
 }
@@ -133,7 +135,7 @@ void __tracer_resolve_bp_filenames(BpOpsData* data, const char* module_file) {
   CU_HashEntry* entry = CU_CreateHashEntry(&data->loaded_modules, name, &is_new);
   if (entry == nullptr || !is_new) return;
   CU_SetHashValue(entry, nullptr);
-  if (store_canonical(entry, name) == nullptr) return;
+  if (store_canonical(data, entry, name) == nullptr) return;
   ++data->unique_import_count;
   resolve_waiting_breakpoints(data, name);
   do_dprintf(kDbgBpFiles, "Done resolving\n");

@@ -3,6 +3,7 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <new>
 
 #include "names/conames.h"
 #include "support/dbgcommon.h"
@@ -101,7 +102,7 @@ void __tracer_clear_bp_ops_data(BpOpsData* data, COPathnameTable* co_pathname_ta
 Breakpoint* __tracer_create_bp(BpOpsData* data, const char* file, int lineno, int enabled,
                                int temporary, PyObject* cond, int ignore_count) {
   int32_t id = data->next_id++;
-  auto* bp = static_cast<Breakpoint*>(std::calloc(1, sizeof(Breakpoint)));
+  auto* bp = new (std::nothrow) Breakpoint{};
   if (bp == nullptr) return nullptr;
   bp->id = id;
   bp->lineno = lineno;
@@ -122,7 +123,7 @@ void __tracer_free_bp(Breakpoint* bp) {
   std::free(bp->user_filename);
   std::free(bp->module_filename);
   std::free(bp->cond);
-  std::free(bp);
+  delete bp;
 }
 
 int __tracer_add_userbp(BpOpsData* data, Breakpoint* bp) {
@@ -288,6 +289,7 @@ int __tracer_set_breaks_cond(BpOpsData* data, const char* file, int lineno, PyOb
   int matched = for_each_matching(data, file, lineno, [cond, &failed](Breakpoint* bp) {
     std::free(bp->cond);
     bp->cond = nullptr;
+    bp->compiled.reset();
     // An empty text is a condition too (one that never evaluates), not "no condition".
     if (cond != Py_None && (bp->cond = _pystring_to_c_string_copy(cond)) == nullptr) {
       failed = true;

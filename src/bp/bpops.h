@@ -11,7 +11,10 @@
 #include <Python.h>
 
 #include <cstdint>
+#include <memory>
+#include <string>
 
+#include "bp/condition.h"
 #include "names/fileops.h"
 #include "support/hashtable.h"
 #include "support/ref.h"
@@ -32,6 +35,9 @@ struct Breakpoint {
   int32_t on_changed_list;   // 1 while on the changed list
   Breakpoint* next_at_line;  // chain of the same line number
   Breakpoint* next_changed;  // changed list
+  // The condition compiled, made at its first evaluation and dropped when the text changes;
+  // shared so that an evaluation keeps it while the condition's code frees the record.
+  std::shared_ptr<const CompiledCondition> compiled;
 };
 
 struct BpOpsData {
@@ -48,6 +54,21 @@ struct BpOpsData {
   // Counts every record freed, for the life of the process: code that runs Python code in
   // the middle of a walk over records (conditions) tells from it whether they still exist.
   uint64_t free_count = 0;
+  // Counts every change of the loaded-module table (a name stored or replaced, the table
+  // emptied), for the life of the process: a canonical name found earlier is still the
+  // answer, and still allocated, while it has not moved.
+  uint64_t modules_generation = 0;
+  // The last code file a line with breakpoints was met in, and its canonical module file
+  // (borrowed from the loaded-module table) as of `resolved_generation`. A hot line asks the
+  // same question at every pass.
+  std::string resolved_code_file;
+  // The line of the line event being delivered, when its source reported it (sys.monitoring
+  // does), for `line_hint_frame` only (borrowed, and set only while that event is
+  // delivered): the hit test then need not work the line out from the frame again.
+  PyObject* line_hint_frame = nullptr;
+  int line_hint = 0;
+  const char* resolved_module_file = nullptr;  // null when no module has that file
+  uint64_t resolved_generation = UINT64_MAX;
 };
 
 void __tracer_init_bp_ops_data(BpOpsData* data, COPathnameTable* co_pathname_table);
@@ -64,6 +85,30 @@ int __tracer_add_userbp(BpOpsData* data, Breakpoint* bp);
 void __tracer_del_userbp(BpOpsData* data, Breakpoint* bp);
 // The chain of breakpoints on `lineno`, newest first, or null.
 Breakpoint* __tracer_bps_at_line(BpOpsData* data, int32_t lineno);
+
+// Marks the line event of `frame` at `line` as being delivered, for the life of the mark.
+// Another thread's event may replace the mark meanwhile (the interpreter lock is given up
+// while a thread waits): a mark is only ever cleared by its own event, and a replaced one is
+// simply missing, so the hit test never reads another event's line.
+class LineHint {
+ public:
+  LineHint(BpOpsData* data, PyObject* frame, int line) : data_(data), frame_(frame), line_(line) {
+    data_->line_hint_frame = frame;
+    data_->line_hint = line;
+  }
+  ~LineHint() {
+    if (data_->line_hint_frame == frame_ && data_->line_hint == line_) {
+      data_->line_hint_frame = nullptr;
+    }
+  }
+  LineHint(const LineHint&) = delete;
+  LineHint& operator=(const LineHint&) = delete;
+
+ private:
+  BpOpsData* data_;
+  PyObject* frame_;
+  int line_;
+};
 
 // ---- The changed list -----------------------------------------------------------------------
 

@@ -25,6 +25,8 @@ struct LineEvent {
   PyObject* frame;
   int event;
   const char* code_file = nullptr;
+  const char* module_file = nullptr;        // the code file's canonical module file, or null
+  uint64_t module_generation = UINT64_MAX;  // of the loaded-module table when it was found
   int lineno = 0;
   bool sub_language = false;
   Ref translated;  // keeps a sub-language frame's file text alive
@@ -56,18 +58,44 @@ bool translate_sub_language_frame(LineEvent& at) {
   return wanted > 0 && usable;
 }
 
+// The code file's canonical module file. The answer for the file met last is kept while
+// the loaded-module table does not change (conditions run Python code, which may import and
+// register modules, or replace the stored name that an earlier answer points to). While
+// file-name diagnostics are written it is looked up each time, so that they show every step.
+const char* module_file_of(BpOpsData* data, LineEvent& at) {
+  if (dprintf_wanted(kDbgBpFiles)) return __tracer_find_module(data, at.code_file);
+  if (at.module_generation == data->modules_generation) return at.module_file;
+  bool same_file = at.code_file != nullptr && data->resolved_code_file == at.code_file;
+  if (same_file && data->resolved_generation == data->modules_generation) {
+    at.module_file = data->resolved_module_file;
+  } else {
+    at.module_file = __tracer_find_module(data, at.code_file);
+    if (at.code_file != nullptr) data->resolved_code_file = at.code_file;
+    data->resolved_module_file = at.module_file;
+    data->resolved_generation = data->modules_generation;
+  }
+  at.module_generation = data->modules_generation;
+  return at.module_file;
+}
+
 // The frame's full file name, which also registers its module so that breakpoints waiting
-// for that file learn it. The program's pending exception is kept.
+// for that file learn it. A file whose module is known already (the one met last, the table
+// unchanged since) has nothing to register. The program's pending exception is kept.
 void find_code_file(BpOpsData* data, LineEvent& at) {
   compat::PendingError saved;
   saved.fetch();
   at.code_file = __tracer_get_full_path(data->co_pathname_table, at.frame);
-  do_dprintf(kDbgBpFiles, "CODE FILE %s\n", dprint_check_str(at.code_file));
-  __tracer_resolve_bp_filenames(data, at.code_file);
+  bool known = !dprintf_wanted(kDbgBpFiles) && at.code_file != nullptr &&
+               data->resolved_generation == data->modules_generation &&
+               data->resolved_module_file != nullptr && data->resolved_code_file == at.code_file;
+  if (!known) {
+    do_dprintf(kDbgBpFiles, "CODE FILE %s\n", dprint_check_str(at.code_file));
+    __tracer_resolve_bp_filenames(data, at.code_file);
+  }
   saved.restore();
 }
 
-bool files_match(BpOpsData* data, const LineEvent& at, const Breakpoint* bp) {
+bool files_match(BpOpsData* data, LineEvent& at, const Breakpoint* bp) {
   if (at.sub_language) {
     do_dprintf(kDbgBpFiles, "sub_language bp codefile = %s, bp->user_filename = %s\n",
                dprint_check_str(at.code_file), dprint_check_str(bp->user_filename));
@@ -75,50 +103,37 @@ bool files_match(BpOpsData* data, const LineEvent& at, const Breakpoint* bp) {
   }
   // A breakpoint whose file no loaded module has matched yet never matches a frame.
   if (bp->module_filename == nullptr) return false;
-  const char* modfile = __tracer_find_module(data, at.code_file);
+  const char* modfile = module_file_of(data, at);
   do_dprintf(kDbgBpFiles, "modfile = %s, bp->module_filename = %s\n", dprint_check_str(modfile),
              dprint_check_str(bp->module_filename));
   return modfile != nullptr && strcmp(modfile, bp->module_filename) == 0;
 }
 
-// The locals a condition is evaluated with: the current values of the frame's variables,
-// never written back. On 3.11 and 3.12 PyFrame_GetLocals copies the fast locals into the
-// frame's locals dictionary; from 3.13 on it answers a write-through proxy of them, so a
-// condition such as `(x := 5) == 0` would change the program's variable. A function frame's
-// condition therefore gets a dictionary copy on every version. Module-level code and class
-// bodies have no fast locals: their namespace is used as it is.
-Ref condition_locals(PyFrameObject* f) {
-  Ref locals = Ref::steal(PyFrame_GetLocals(f));
-  Ref code = Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetCode(f)));
-  bool fast = (reinterpret_cast<PyCodeObject*>(code.get())->co_flags & CO_OPTIMIZED) != 0;
-  if (!locals || !fast) return locals;
-  Ref copy = Ref::steal(PyDict_New());
-  if (!copy || PyDict_Update(copy.get(), locals.get()) != 0) return Ref();
-  return copy;
+// The record's compiled condition, made at its first evaluation. The caller holds its own
+// reference: the condition's code may change the text or free the record.
+std::shared_ptr<const CompiledCondition> compiled_condition(Breakpoint* bp) {
+  if (!bp->compiled) bp->compiled = condition_compile(bp->cond);
+  return bp->compiled;
 }
 
 // Evaluates a condition in the frame's namespace: 1 true, 0 false, -1 when it cannot be
 // evaluated (a broken condition stops). Nothing it raises reaches the program.
-int evaluate_condition(const LineEvent& at, const char* cond) {
+int evaluate_condition(const LineEvent& at, Breakpoint* bp) {
   compat::PendingError saved;
   saved.fetch();
-  Ref result;
+  int truth = -1;
   if (at.sub_language) {
-    Ref text = Ref::steal(gPtrTo_PyUnicode_FromString(cond));
+    Ref text = Ref::steal(gPtrTo_PyUnicode_FromString(bp->cond));
+    Ref result;
     if (text) {
       result = Ref::steal(PyObject_CallMethod(at.thread->sub_language_hook.get(), "_Eval", "OO",
                                               text.get(), at.frame));
     }
+    truth = result ? PyObject_IsTrue(result.get()) : -1;
   } else {
-    auto* f = reinterpret_cast<PyFrameObject*>(at.frame);
-    Ref locals = condition_locals(f);
-    Ref globals = Ref::steal(PyFrame_GetGlobals(f));
-    if (locals && globals) {
-      result =
-          Ref::steal(PyRun_StringFlags(cond, Py_eval_input, globals.get(), locals.get(), nullptr));
-    }
+    std::shared_ptr<const CompiledCondition> condition = compiled_condition(bp);
+    truth = condition_evaluate(*condition, reinterpret_cast<PyFrameObject*>(at.frame));
   }
-  int truth = result ? PyObject_IsTrue(result.get()) : -1;
   saved.restore();  // also drops whatever the condition raised
   return truth < 0 ? -1 : truth;
 }
@@ -146,14 +161,16 @@ int __tracer_break_here(BpOpsData* data, int event, ThreadData* thread, PyObject
                         int count) {
   // No breakpoint anywhere: nothing to find, whatever the frame (the common line event).
   if (data->bp_table.num_entries == 0 || !compat::is_plain_frame(frame)) return 0;
-  LineEvent at{thread, frame, event, nullptr, 0, false, Ref()};
+  LineEvent at{thread, frame, event, nullptr, nullptr, UINT64_MAX, 0, false, Ref()};
   // Only a thread inside a sub-language has key frames (an inline test before the call).
   if (thread != nullptr && thread->sub_language_hook &&
       __tracer_sub_language_get_frame_category(thread, frame) == 1) {
     enter_debugger();  // the hook is Python code
     if (!translate_sub_language_frame(at)) return 0;
   } else {
-    at.lineno = PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(frame));
+    at.lineno = frame == data->line_hint_frame
+                    ? data->line_hint
+                    : PyFrame_GetLineNumber(reinterpret_cast<PyFrameObject*>(frame));
   }
   Breakpoint* bp = __tracer_bps_at_line(data, at.lineno);
   if (bp == nullptr) return 0;
@@ -177,7 +194,7 @@ int __tracer_break_here(BpOpsData* data, int event, ThreadData* thread, PyObject
       continue;
     }
     uint64_t frees = data->free_count;
-    int truth = evaluate_condition(at, bp->cond);
+    int truth = evaluate_condition(at, bp);
     // The condition freed breakpoints (cleared them, or reset the core): neither this record
     // nor the rest of the chain may be touched any more.
     if (frees != data->free_count) return stop || truth != 0 ? 1 : 0;

@@ -55,6 +55,15 @@ PyObject* deliver(int what, PyObject* arg) {
   Py_RETURN_NONE;
 }
 
+// A line event whose line LINE reported (or -1): the hit test reads it instead of working it
+// out from the frame again.
+PyObject* deliver_line(long line) {
+  PyFrameObject* frame = PyEval_GetFrame();  // borrowed: the event's frame
+  if (frame == nullptr || line < 0 || line > INT32_MAX) return deliver(PyTrace_LINE, nullptr);
+  LineHint hint(&gSelf.bp_ops_data, reinterpret_cast<PyObject*>(frame), static_cast<int>(line));
+  return deliver(PyTrace_LINE, nullptr);
+}
+
 // PY_THROW: a call event whose place must never answer DISABLE (see the head of the file).
 PyObject* on_throw(PyObject*, PyObject* const*, Py_ssize_t) {
   return deliver(PyTrace_CALL, nullptr);
@@ -226,13 +235,10 @@ PyObject* quiet_if_possible(PyObject* answer, PyObject* code, long line) {
 }
 
 PyObject* on_line(PyObject*, PyObject* const* args, Py_ssize_t nargs) {
-  PyObject* answer = deliver(PyTrace_LINE, nullptr);
-  if (answer == nullptr || nargs < 2) return answer;
-  long line = PyLong_AsLong(args[1]);
-  if (line == -1 && PyErr_Occurred() != nullptr) {
-    PyErr_Clear();
-    return answer;
-  }
+  long line = nargs >= 2 ? PyLong_AsLong(args[1]) : -1;
+  if (line == -1 && PyErr_Occurred() != nullptr) PyErr_Clear();
+  PyObject* answer = deliver_line(line);
+  if (answer == nullptr || line < 0) return answer;
   return quiet_if_possible(answer, args[0], line);
 }
 

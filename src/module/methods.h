@@ -7,6 +7,9 @@
 // analysis_module.cpp: makes the submodule `analysis` and sets it on the main module and in
 // sys.modules. 0, or -1 with the error set.
 int add_analysis_module(PyObject* parent);
+// breakpoints_module.cpp: the submodule `breakpoints`, added to `parent` and sys.modules.
+// 0, or -1 with an error set.
+int add_breakpoints_module(PyObject* parent);
 
 // vantrelmodule.cpp: lifecycle.
 PyObject* _tracer_init(PyObject* self, PyObject* args);

@@ -314,6 +314,10 @@ PyMODINIT_FUNC PyInit_tvantrel30pydebugstackless(void) {
   if (gModuleSelf != nullptr) return Py_NewRef(gModuleSelf);
   gModuleSelf = PyModule_Create2(&gModuleDef, PYTHON_API_VERSION);
   if (gModuleSelf == nullptr) return nullptr;
+  if (add_breakpoints_module(gModuleSelf) != 0) {
+    Py_CLEAR(gModuleSelf);
+    return nullptr;
+  }
   init_threadops();
   init_tracercore();
   // The handler analysis reads the interpreter's opcode tables now, never inside an event;

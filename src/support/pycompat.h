@@ -275,6 +275,117 @@ inline bool is_plain_frame(PyObject* obj) noexcept {
   return Py_IS_TYPE(obj, &PyFrame_Type);
 }
 
+// Whether `obj` is the write-through view of a function frame's variables that
+// PyFrame_GetLocals answers from 3.13 on (earlier versions answer a dictionary).
+inline bool is_frame_locals_proxy(PyObject* obj) noexcept {
+#if PY_VERSION_HEX >= 0x030D0000
+  return PyFrameLocalsProxy_Check(obj);
+#else
+  (void)obj;
+  return false;
+#endif
+}
+
+// The attribute `name` of `type` or of a type in its method resolution order, or null when
+// none has it. Borrowed; sets no error and runs no Python code. The interpreter's own
+// look-up (exported but private on every supported version).
+inline PyObject* type_lookup(PyTypeObject* type, PyObject* name) noexcept {
+  return _PyType_Lookup(type, name);
+}
+
+// ---- A function frame's own variables ----------------------------------------------------
+//
+// On 3.11 and 3.12 the only public way to read one variable of a running function frame is
+// PyFrame_GetLocals, which copies every variable into the frame's dictionary first. A hot
+// breakpoint condition that reads one variable reads its slot here instead, through the
+// layout of the interpreter's frame records (private: tests/native/core/test_pycompat.cpp
+// fails where it moved). From 3.13 on PyFrame_GetLocals answers a view that reads the slots
+// itself, and this answers "unknown".
+
+enum class FastLocal { kValue, kUnbound, kUnknown };
+
+#if PY_VERSION_HEX < 0x030D0000
+namespace frame_layout {
+struct FrameObject {
+  PyObject_HEAD PyObject* f_back;
+  void* f_frame;  // the interpreter's record of the running frame
+};
+#if PY_VERSION_HEX >= 0x030C0000
+struct InterpreterFrame {
+  PyCodeObject* f_code;
+  void* previous;
+  PyObject* f_funcobj;
+  PyObject* f_globals;
+  PyObject* f_builtins;
+  PyObject* f_locals;
+  PyFrameObject* frame_obj;
+  void* prev_instr;
+  int stacktop;
+  uint16_t return_offset;
+  char owner;
+  PyObject* localsplus[1];
+};
+#else
+struct InterpreterFrame {
+  PyObject* f_func;
+  PyObject* f_globals;
+  PyObject* f_builtins;
+  PyObject* f_locals;
+  PyCodeObject* f_code;
+  PyFrameObject* frame_obj;
+  void* previous;
+  void* prev_instr;
+  int stacktop;
+  bool is_entry;
+  char owner;
+  PyObject* localsplus[1];
+};
+#endif
+// Kinds of a code object's variables (co_localspluskinds).
+constexpr unsigned char kPlainLocal = 0x20;
+constexpr unsigned char kNotPlain = 0x10 | 0x40 | 0x80;  // hidden, cell, free
+}  // namespace frame_layout
+#endif
+
+// The plain local variable `name` (a str) of a running function frame, read from
+// its slot: kValue with `*value` borrowed, or kUnbound. kUnknown when the frame is no
+// function's, `name` is not one of its plain locals (a cell, a free or hidden variable, a
+// name it does not have), or the interpreter offers no such read; the caller then asks
+// PyFrame_GetLocals.
+inline FastLocal frame_fast_local(PyFrameObject* frame, PyObject* name, PyObject** value) noexcept {
+#if PY_VERSION_HEX >= 0x030D0000
+  (void)frame, (void)name, (void)value;
+  return FastLocal::kUnknown;
+#else
+  auto* record = static_cast<frame_layout::InterpreterFrame*>(
+      reinterpret_cast<frame_layout::FrameObject*>(frame)->f_frame);
+  if (record == nullptr || record->frame_obj != frame) return FastLocal::kUnknown;
+  // The record must be the frame's own: it points back at the frame object, and its code is
+  // the one the public call answers.
+  PyCodeObject* code = record->f_code;
+  PyCodeObject* expected = PyFrame_GetCode(frame);
+  Py_DECREF(expected);
+  if (code != expected || (code->co_flags & CO_OPTIMIZED) == 0) return FastLocal::kUnknown;
+  PyObject* names = code->co_localsplusnames;
+  const char* kinds = PyBytes_AS_STRING(code->co_localspluskinds);
+  for (int i = 0; i < code->co_nlocalsplus; ++i) {
+    PyObject* own = PyTuple_GET_ITEM(names, i);
+    // Names are interned on both sides as a rule; equal text is the same name regardless.
+    if (own != name && (PyUnicode_GET_LENGTH(own) != PyUnicode_GET_LENGTH(name) ||
+                        PyUnicode_Compare(own, name) != 0)) {
+      continue;
+    }
+    auto kind = static_cast<unsigned char>(kinds[i]);
+    if ((kind & frame_layout::kNotPlain) != 0 || (kind & frame_layout::kPlainLocal) == 0) {
+      return FastLocal::kUnknown;
+    }
+    *value = record->localsplus[i];
+    return *value != nullptr ? FastLocal::kValue : FastLocal::kUnbound;
+  }
+  return FastLocal::kUnknown;
+#endif
+}
+
 // The caller of `frame`, or a null Ref at the bottom. New reference.
 inline Ref frame_back(PyFrameObject* frame) noexcept {
   return Ref::steal(reinterpret_cast<PyObject*>(PyFrame_GetBack(frame)));

@@ -165,4 +165,86 @@ TEST_F(CompatTest, UseTracingSwitchBelongsToTheThreadStateNotTheOsThread) {
   EXPECT_EQ(second_use, 0);  // no trace function in the new thread state
 }
 
+TEST_F(CompatTest, TypeLookupFindsClassAttributesAlongTheMroAndNothingElse) {
+  // The fast evaluation of conditions reads an instance attribute directly only when the
+  // type has no attribute of that name; the look-up must see inherited ones and never an
+  // instance's own.
+  Ref ns = coretest::make_namespace(
+      "class Base:\n    inherited = 1\nclass Child(Base):\n    pass\nobj = Child()\n"
+      "obj.own = 2\n");
+  auto* child = reinterpret_cast<PyTypeObject*>(coretest::item(ns.get(), "Child"));
+  Ref inherited = Ref::steal(PyUnicode_FromString("inherited"));
+  Ref own = Ref::steal(PyUnicode_FromString("own"));
+  Ref real = Ref::steal(PyUnicode_FromString("real"));
+  EXPECT_NE(compat::type_lookup(child, inherited.get()), nullptr);
+  EXPECT_EQ(compat::type_lookup(child, own.get()), nullptr);
+  EXPECT_NE(compat::type_lookup(&PyLong_Type, real.get()), nullptr);
+  EXPECT_EQ(PyErr_Occurred(), nullptr);
+}
+
+TEST_F(CompatTest, FrameLocalsProxyIsRecognisedWhereTheInterpreterAnswersOne) {
+  Ref ns = coretest::make_namespace(
+      "import sys\ndef f():\n    x = 1\n    return sys._getframe()\nframe = f()\n");
+  auto* frame = reinterpret_cast<PyFrameObject*>(coretest::item(ns.get(), "frame"));
+  Ref locals = Ref::steal(PyFrame_GetLocals(frame));
+  ASSERT_TRUE(locals);
+  EXPECT_EQ(compat::is_frame_locals_proxy(locals.get()), !PyDict_Check(locals.get()));
+  EXPECT_EQ(compat::is_frame_locals_proxy(PyLong_Type.tp_dict), false);
+}
+
+// What frame_fast_local answered for the names below, read by `probe` from inside the
+// running frame (the hit test reads frames that run).
+struct FastLocalReads {
+  compat::FastLocal kind[6];
+  PyObject* value[6];
+};
+FastLocalReads gReads;
+constexpr const char* kReadNames[6] = {"plain", "arg", "other", "unbound", "cell", "sys"};
+
+PyObject* probe(PyObject*, PyObject*) {
+  PyFrameObject* frame = PyEval_GetFrame();  // borrowed: the calling Python frame
+  for (int i = 0; i < 6; ++i) {
+    Ref name = Ref::steal(PyUnicode_InternFromString(kReadNames[i]));
+    gReads.value[i] = nullptr;
+    gReads.kind[i] = compat::frame_fast_local(frame, name.get(), &gReads.value[i]);
+  }
+  Py_RETURN_NONE;
+}
+
+PyMethodDef gProbeDef = {"probe", probe, METH_NOARGS, nullptr};
+
+TEST_F(CompatTest, FrameFastLocalReadsThePlainVariablesOfARunningFunctionFrame) {
+  // The frame records' layout is the interpreter's own: a read that lands elsewhere answers
+  // wrong values here (or unknown everywhere), not only on the version where it moved.
+  Ref ns = coretest::make_namespace(
+      "def f(arg, other='o'):\n"
+      "    plain = 3\n"
+      "    cell = 4\n"
+      "    def inner():\n"
+      "        return cell\n"
+      "    probe()\n"
+      "    return plain\n"
+      "    unbound = 5\n");
+  Ref function = Ref::steal(PyCFunction_New(&gProbeDef, nullptr));
+  ASSERT_TRUE(function);
+  ASSERT_EQ(PyDict_SetItemString(ns.get(), "probe", function.get()), 0);
+  Ref one = Ref::steal(PyLong_FromLong(1));
+  Ref result = Ref::steal(PyObject_CallOneArg(coretest::item(ns.get(), "f"), one.get()));
+  ASSERT_TRUE(result);
+#if PY_VERSION_HEX < 0x030D0000
+  ASSERT_EQ(gReads.kind[0], compat::FastLocal::kValue);
+  EXPECT_EQ(PyLong_AsLong(gReads.value[0]), 3);
+  ASSERT_EQ(gReads.kind[1], compat::FastLocal::kValue);
+  EXPECT_EQ(PyLong_AsLong(gReads.value[1]), 1);
+  ASSERT_EQ(gReads.kind[2], compat::FastLocal::kValue);
+  EXPECT_EQ(PyUnicode_CompareWithASCIIString(gReads.value[2], "o"), 0);
+  EXPECT_EQ(gReads.kind[3], compat::FastLocal::kUnbound);
+  EXPECT_EQ(gReads.kind[4], compat::FastLocal::kUnknown);  // a cell
+  EXPECT_EQ(gReads.kind[5], compat::FastLocal::kUnknown);  // not a variable of f
+#else
+  EXPECT_EQ(gReads.kind[0], compat::FastLocal::kUnknown);
+#endif
+  EXPECT_EQ(PyErr_Occurred(), nullptr);
+}
+
 }  // namespace
