@@ -22,6 +22,7 @@
 #include "core/thread_policy.h"
 #include "core/tracercore.h"
 #include "exc/exceptops.h"
+#include "exc/handlers.h"
 #include "names/conames.h"
 #include "support/dbgcommon.h"
 #include "support/dprintf.h"
@@ -468,14 +469,17 @@ PyObject* recorded_value(PyObject* recorded) {
 
 // A frame on a line of its own is done with the exception recorded for it, unless it is
 // still handling that very exception (an except, finally or with-exit block, which may yet
-// raise it again). The trace function reports no handling: this is where a caught
-// exception's record goes, so that it keeps nothing alive past the handler's end.
+// raise it again) or just entering the handler that will (its line event comes before the
+// interpreter shows the exception as handled; a with block's exit still decides whether the
+// exception leaves the frame). The trace function reports no handling: this is where a
+// caught exception's record goes, so that it keeps nothing alive past the handler's end.
 void forget_exception_left_behind(PyObject* frame) {
   if (!gSelf.exc_data.frame_exc_info) return;
   PyObject* recorded = find_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame);
   if (recorded == nullptr) return;
   Ref handled = Ref::steal(PyErr_GetHandledException());
   if (handled && handled.get() == recorded_value(recorded)) return;
+  if (frame_entering_handler(frame)) return;
   enter_debugger();  // dropping the record can run finalizers
   forget_frame_exc_info(&gSelf.exc_data.frame_exc_info, frame);
 }

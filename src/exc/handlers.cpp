@@ -859,6 +859,14 @@ int frame_has_active_handler(PyObject* frame) {
   return 0;
 }
 
+int frame_entering_handler(PyObject* frame) {
+  if (!table().ready || frame == nullptr || !compat::is_plain_frame(frame)) return 0;
+  KeepThreadState keep;
+  FrameCode fc;
+  if (!fc.open(as_frame(frame))) return 0;
+  return is(fc.opcode_around(PyFrame_GetLasti(as_frame(frame))), bytecode::kPushExcInfo) ? 1 : 0;
+}
+
 PyObject* __find_inner_frame(PyObject* traceback) {
   if (traceback == nullptr || traceback == Py_None) return Py_NewRef(Py_None);
   KeepThreadState keep;

@@ -100,6 +100,11 @@ int exc_stop_iter_handled(PyObject* frame, PyObject* exc);
 // frame has an active block" means without a block stack.
 int frame_has_active_handler(PyObject* frame);
 
+// 1 when the frame stands at the first instruction of an exception handler (PUSH_EXC_INFO):
+// the exception it just raised or received is about to be handled there, although the
+// interpreter does not show it as handled yet. Else 0; leaves no error.
+int frame_entering_handler(PyObject* frame);
+
 // New reference to the frame of the innermost entry of a traceback chain; None for None; null
 // (no error pending) when an entry has no frame.
 PyObject* __find_inner_frame(PyObject* traceback);

@@ -153,10 +153,4 @@ PyModuleDef gAnalysisDef = {
 
 }  // namespace
 
-int add_analysis_module(PyObject* parent) {
-  Ref analysis = Ref::steal(PyModule_Create2(&gAnalysisDef, PYTHON_API_VERSION));
-  if (!analysis) return -1;
-  if (PyModule_AddObjectRef(parent, "analysis", analysis.get()) != 0) return -1;
-  PyObject* modules = PyImport_GetModuleDict();  // borrowed
-  return PyDict_SetItemString(modules, "tvantrel30pydebugstackless.analysis", analysis.get());
-}
+int add_analysis_module(PyObject* parent) { return add_submodule(parent, &gAnalysisDef); }

@@ -53,10 +53,4 @@ PyModuleDef gBreakpointsDef = {
 
 }  // namespace
 
-int add_breakpoints_module(PyObject* parent) {
-  Ref breakpoints = Ref::steal(PyModule_Create2(&gBreakpointsDef, PYTHON_API_VERSION));
-  if (!breakpoints) return -1;
-  if (PyModule_AddObjectRef(parent, "breakpoints", breakpoints.get()) != 0) return -1;
-  PyObject* modules = PyImport_GetModuleDict();  // borrowed
-  return PyDict_SetItemString(modules, "tvantrel30pydebugstackless.breakpoints", breakpoints.get());
-}
+int add_breakpoints_module(PyObject* parent) { return add_submodule(parent, &gBreakpointsDef); }

@@ -4,6 +4,10 @@
 
 #include <Python.h>
 
+// vantrelmodule.cpp: makes the submodule that `def` describes (named "<main>.<name>"), sets
+// it on `parent` as <name> and puts it in sys.modules. 0, or -1 with the error set.
+int add_submodule(PyObject* parent, PyModuleDef* def);
+
 // analysis_module.cpp: makes the submodule `analysis` and sets it on the main module and in
 // sys.modules. 0, or -1 with the error set.
 int add_analysis_module(PyObject* parent);

@@ -4,6 +4,7 @@
 #include <Python.h>
 
 #include <cstdio>
+#include <cstring>
 
 #include <pthread.h>
 
@@ -297,6 +298,16 @@ Fn lookup_first(const char* const (&names)[3]) {
 }
 
 }  // namespace
+
+int add_submodule(PyObject* parent, PyModuleDef* def) {
+  Ref module = Ref::steal(PyModule_Create2(def, PYTHON_API_VERSION));
+  if (!module) return -1;
+  const char* dot = std::strrchr(def->m_name, '.');
+  const char* name = dot != nullptr ? dot + 1 : def->m_name;
+  if (PyModule_AddObjectRef(parent, name, module.get()) != 0) return -1;
+  PyObject* modules = PyImport_GetModuleDict();  // borrowed
+  return PyDict_SetItemString(modules, def->m_name, module.get());
+}
 
 PyMODINIT_FUNC PyInit_tvantrel30pydebugstackless(void) {
   static const char* const kFromString[3] = {"PyUnicodeUCS2_FromString", "PyUnicodeUCS4_FromString",
