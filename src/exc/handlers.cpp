@@ -41,11 +41,11 @@ PyObject* (*gFrameGetVar)(PyFrameObject*, PyObject*) = nullptr;
 
 // Bounds that keep a malformed or adversarial code object from making the analysis loop:
 // far above anything a compiler emits for one clause or one nest of handlers.
-constexpr int kMaxValues = 32;           // values of one class expression (or of all except*)
-constexpr int kMaxClauseSteps = 256;     // instructions of one class expression
-constexpr int kMaxClauses = 256;         // clauses of one chain
-constexpr int kMaxHandlerHops = 256;     // nested handlers of one frame
-constexpr int kMaxGroupDepth = 32;       // nesting of exception groups
+constexpr int kMaxValues = 32;        // values of one class expression (or of all except*)
+constexpr int kMaxClauseSteps = 256;  // instructions of one class expression
+constexpr int kMaxClauses = 256;      // clauses of one chain
+constexpr int kMaxHandlerHops = 256;  // nested handlers of one frame
+constexpr int kMaxGroupDepth = 32;    // nesting of exception groups
 
 const bytecode::Opcodes& table() {
   return bytecode::opcodes();
@@ -157,8 +157,10 @@ Ref lookup_name(PyObject* mapping, PyObject* name, bool* failed) {
   }
   Ref value = Ref::steal(PyObject_GetItem(mapping, name));
   if (!value) {
-    if (PyErr_ExceptionMatches(PyExc_KeyError)) PyErr_Clear();
-    else *failed = true;
+    if (PyErr_ExceptionMatches(PyExc_KeyError))
+      PyErr_Clear();
+    else
+      *failed = true;
   }
   return value;
 }
@@ -206,9 +208,9 @@ struct ValueStack {
 
 // The shape of one clause, read before anything is evaluated.
 struct ClauseShape {
-  int expr = 0;      // first instruction of the class expression
-  int check = 0;     // its CHECK_EXC_MATCH / CHECK_EG_MATCH
-  int next = 0;      // target of the clause's conditional jump
+  int expr = 0;        // first instruction of the class expression
+  int check = 0;       // its CHECK_EXC_MATCH / CHECK_EG_MATCH
+  int next = 0;        // target of the clause's conditional jump
   bool tuple = false;  // the expression ends with BUILD_TUPLE of all its values
 };
 
@@ -419,20 +421,17 @@ Verdict except_chain(const FrameCode& fc, Namespaces& ns, int pos, const Query& 
 
 // Whether `node` is entirely taken by the except* clauses: matched itself, or a group whose
 // every member is.
-bool group_covered(PyObject* node, const ClauseItems& all, PyObject* type_of_root,
-                   const Query& q, int depth) {
-  PyObject* node_type =
-      node == q.exc ? type_of_root : reinterpret_cast<PyObject*>(Py_TYPE(node));
+bool group_covered(PyObject* node, const ClauseItems& all, PyObject* type_of_root, const Query& q,
+                   int depth) {
+  PyObject* node_type = node == q.exc ? type_of_root : reinterpret_cast<PyObject*>(Py_TYPE(node));
   if (any_item_matches(all, node, node_type, q.kind)) return true;
-  if (depth == kMaxGroupDepth || !PyObject_TypeCheck(node, reinterpret_cast<PyTypeObject*>(
-                                                               PyExc_BaseExceptionGroup)))
+  if (depth == kMaxGroupDepth ||
+      !PyObject_TypeCheck(node, reinterpret_cast<PyTypeObject*>(PyExc_BaseExceptionGroup)))
     return false;
   PyObject* members = reinterpret_cast<PyBaseExceptionGroupObject*>(node)->excs;
-  if (members == nullptr || !PyTuple_Check(members) || PyTuple_GET_SIZE(members) == 0)
-    return false;
+  if (members == nullptr || !PyTuple_Check(members) || PyTuple_GET_SIZE(members) == 0) return false;
   for (Py_ssize_t i = 0; i < PyTuple_GET_SIZE(members); ++i) {
-    if (!group_covered(PyTuple_GET_ITEM(members, i), all, type_of_root, q, depth + 1))
-      return false;
+    if (!group_covered(PyTuple_GET_ITEM(members, i), all, type_of_root, q, depth + 1)) return false;
   }
   return true;
 }
@@ -824,8 +823,8 @@ int catch_prediction_line(const CatchPrediction& prediction) {
   return line > 0 ? line : PyFrame_GetLineNumber(frame);
 }
 
-int __tracer_exc_handled(PyObject* frame, PyObject* ignored_handlers, PyObject* exc,
-                         int match_kind, int this_frame_only) {
+int __tracer_exc_handled(PyObject* frame, PyObject* ignored_handlers, PyObject* exc, int match_kind,
+                         int this_frame_only) {
   CatchQuestion question;
   question.frame = frame;
   question.exc = exc;
@@ -874,8 +873,8 @@ PyObject* __find_inner_frame(PyObject* traceback) {
   for (;;) {
     Ref next;
     if (PyTraceBack_Check(entry.get())) {
-      next = Ref::borrow(reinterpret_cast<PyObject*>(
-          reinterpret_cast<PyTracebackObject*>(entry.get())->tb_next));
+      next = Ref::borrow(
+          reinterpret_cast<PyObject*>(reinterpret_cast<PyTracebackObject*>(entry.get())->tb_next));
     } else {
       next = Ref::steal(PyObject_GetAttrString(entry.get(), "tb_next"));
       if (!next) PyErr_Clear();

@@ -87,8 +87,8 @@ CatchPrediction predict_catch(const CatchQuestion& question);
 int catch_prediction_line(const CatchPrediction& prediction);
 
 // 1 when predict_catch answers kCaught for these arguments (the walk goes to the last frame).
-int __tracer_exc_handled(PyObject* frame, PyObject* ignored_handlers, PyObject* exc,
-                         int match_kind, int this_frame_only);
+int __tracer_exc_handled(PyObject* frame, PyObject* ignored_handlers, PyObject* exc, int match_kind,
+                         int this_frame_only);
 
 // 1 when the frame's current instruction is FOR_ITER or SEND and `exc` (instance or class)
 // matches StopIteration: the running loop or delegation ends with it.

@@ -53,10 +53,9 @@ constexpr const char* kOpNames[kOpCount] = {
 };
 
 // Without these the shapes of an except clause cannot be read at all.
-constexpr Op kRequired[] = {kCache,      kExtendedArg,   kPopTop,    kPushExcInfo,
-                            kCheckExcMatch, kJumpIfFalse, kReraise,  kLoadConst,
-                            kLoadName,   kLoadGlobal,    kLoadAttr,  kLoadFast,
-                            kBuildTuple};
+constexpr Op kRequired[] = {kCache,       kExtendedArg, kPopTop,    kPushExcInfo, kCheckExcMatch,
+                            kJumpIfFalse, kReraise,     kLoadConst, kLoadName,    kLoadGlobal,
+                            kLoadAttr,    kLoadFast,    kBuildTuple};
 
 // opmap[name] as an opcode number, or kAbsent (pseudo opcodes, >= 256, never reach co_code).
 // opmap is a dict up to 3.14 and a frozendict (no dict subclass) in 3.15: read it as a mapping.
@@ -148,7 +147,8 @@ int stopiteration_intrinsic(PyObject* opcode_module) {
   }
   for (Py_ssize_t i = 0; i < PyTuple_GET_SIZE(seq.get()); ++i) {
     PyObject* name = PyTuple_GET_ITEM(seq.get(), i);
-    if (PyUnicode_Check(name) && PyUnicode_CompareWithASCIIString(name, "INTRINSIC_STOPITERATION_ERROR") == 0)
+    if (PyUnicode_Check(name) &&
+        PyUnicode_CompareWithASCIIString(name, "INTRINSIC_STOPITERATION_ERROR") == 0)
       return static_cast<int>(i);
   }
   return kAbsent;
@@ -194,9 +194,12 @@ bool calibrate_operands(Opcodes* table) {
         return false;
       }
     } else if (ins.op == table->op[kLoadAttr]) {
-      if (ins.arg == 4) table->attr_name_shift = 1;
-      else if (ins.arg == 2) table->attr_name_shift = 0;
-      else return false;
+      if (ins.arg == 4)
+        table->attr_name_shift = 1;
+      else if (ins.arg == 2)
+        table->attr_name_shift = 0;
+      else
+        return false;
       saw_attr = true;
     } else if (ins.op == table->op[kLoadFastLoadFast] ||
                ins.op == table->op[kLoadFastBorrowLoadFastBorrow]) {

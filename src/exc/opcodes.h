@@ -90,8 +90,8 @@ int init_opcodes() noexcept;
 struct Instr {
   int offset = 0;  // byte offset of the instruction (after its EXTENDED_ARG prefixes)
   int op = 0;
-  int arg = 0;     // EXTENDED_ARG prefixes folded in
-  int next = 0;    // byte offset of the following instruction, past the inline caches
+  int arg = 0;   // EXTENDED_ARG prefixes folded in
+  int next = 0;  // byte offset of the following instruction, past the inline caches
 };
 
 // Decodes the instruction at byte `offset` of `code` (`size` bytes), folding EXTENDED_ARG

@@ -153,4 +153,6 @@ PyModuleDef gAnalysisDef = {
 
 }  // namespace
 
-int add_analysis_module(PyObject* parent) { return add_submodule(parent, &gAnalysisDef); }
+int add_analysis_module(PyObject* parent) {
+  return add_submodule(parent, &gAnalysisDef);
+}

@@ -53,4 +53,6 @@ PyModuleDef gBreakpointsDef = {
 
 }  // namespace
 
-int add_breakpoints_module(PyObject* parent) { return add_submodule(parent, &gBreakpointsDef); }
+int add_breakpoints_module(PyObject* parent) {
+  return add_submodule(parent, &gBreakpointsDef);
+}

@@ -681,8 +681,8 @@ def get():
   ASSERT_TRUE(tb);
   Ref frame = Ref::steal(__find_inner_frame(tb.get()));
   ASSERT_TRUE(frame);
-  Ref code = Ref::steal(reinterpret_cast<PyObject*>(
-      PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(frame.get()))));
+  Ref code = Ref::steal(
+      reinterpret_cast<PyObject*>(PyFrame_GetCode(reinterpret_cast<PyFrameObject*>(frame.get()))));
   EXPECT_STREQ(PyUnicode_AsUTF8(reinterpret_cast<PyCodeObject*>(code.get())->co_name), "c");
   Ref none = Ref::steal(__find_inner_frame(Py_None));
   EXPECT_TRUE(none.is_none());
