@@ -514,3 +514,28 @@ def test_the_same_exceptions_stop_when_they_escape(tmp_path):
         assert status == 1
     finally:
         dbg.close()
+
+
+def test_pytest_and_platform_start_without_a_stop(tmp_path):
+    # Two programs whose start-up raises and handles exceptions in their own code and through
+    # C code: a passing pytest suite, and `python -m platform`. Under the default setting
+    # neither may stop; each must end as it does untraced.
+    write(tmp_path, "suite/test_ok.py", """
+        def test_ok():
+            assert sorted({"b": 1, "a": 2}) == ["a", "b"]
+    """)
+    dbg = Session.debug(tmp_path, "--no-stop-at-start", "-m", "pytest", "-q",
+                        "-p", "no:cacheprovider", "suite", timeout=60)
+    try:
+        out, status = dbg.finish()
+        assert "!!" not in out and "(selvane)" not in out, out
+        assert "1 passed" in out and status == 0
+    finally:
+        dbg.close()
+    dbg = Session.debug(tmp_path, "--no-stop-at-start", "-m", "platform", timeout=60)
+    try:
+        out, status = dbg.finish()
+        assert "!!" not in out and "(selvane)" not in out, out
+        assert "Linux" in out and status == 0
+    finally:
+        dbg.close()
