@@ -756,8 +756,11 @@ CatchPrediction walk_frames(const CatchQuestion& question, const Query& q) {
     if (ends_at_body_exit(f, q.exc)) return prediction(CatchKind::kCaught, current, -1);
     if (question.this_frame_only || current.get() == question.outermost) break;
     Ref back = compat::frame_back(f);
+    // C code called by a frame whose handlers are ignored belongs to what runs the program
+    // (on 3.14 a thread's bootstrap calls run() through Context.run): it ends nothing.
     if (back && compat::is_plain_frame(back.get()) && maybe_counts &&
-        maybe.kind == CatchKind::kUncaught && c_code_between(f, as_frame(back.get())))
+        maybe.kind == CatchKind::kUncaught && c_code_between(f, as_frame(back.get())) &&
+        frame_handlers_ignored(back.get(), question.ignored_handlers) == 0)
       maybe = prediction(CatchKind::kCCode, back, -1);
     current = std::move(back);
   }
